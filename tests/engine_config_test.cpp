@@ -3,7 +3,10 @@
 
 #include "engine/wccp_query.h"
 
-#include "runtime/list.h"
+#include <set>
+
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_view_utils.h"
 #include "tests/support/engine_fixture.h"
 
 namespace {
@@ -11,46 +14,37 @@ namespace {
 using bytes = std::vector<uint8_t>;
 using numbers = std::vector<uint32_t>;
 
+// All three tables have the same groups, with the right links.
 void tables_agree() {
-    uint32_t slots = 0, listed = 0, on_interfaces = 0;
+    std::multiset<const wccp_service_group *> slots, listed, on_interfaces;
     for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++)
-        if (wccp_g.groups[id]) {
-            slots++;
-            EXPECT_EQ(wccp_g.groups[id]->id, id);
-        }
-    for (wccp_service_group **link = &wccp_g.group_list; *link; link = &(*link)->next) {
-        listed++;
-        EXPECT_TRUE((*link)->prev_link == link && wccp_g.groups[(*link)->id] == *link);
-    }
-    for (uint32_t i = 0; i < wccp_g.if_count; i++)
-        for (wccp_service_group **link = &wccp_g.interfaces[i].groups; *link; link = &(*link)->if_next) {
-            on_interfaces++;
-            EXPECT_TRUE((*link)->if_prev_link == link && (*link)->interfaces[0] == &wccp_g.interfaces[i]);
-        }
-    EXPECT_TRUE(slots == wccp_g.group_count && listed == slots && on_interfaces == slots);
+        if (wccp_g.groups[id] && wccp_g.groups[id]->id == id)
+            slots.insert(wccp_g.groups[id]);
+    for (wccp_service_group **link = &wccp_g.group_list; *link; link = &(*link)->next)
+        if ((*link)->prev_link == link)
+            listed.insert(*link);
+    for (wccp_interface &each : wccp_g.interfaces)
+        for (wccp_service_group **link = &each.groups; *link; link = &(*link)->if_next)
+            if ((*link)->if_prev_link == link && (*link)->interfaces[0] == &each)
+                on_interfaces.insert(*link);
+    EXPECT_TRUE(slots.size() == wccp_g.group_count && listed == slots && on_interfaces == slots);
 }
 
 struct Config : testing::Test {
     void SetUp() override { engine.router_socket("10.0.0.2"); }
     void TearDown() override { tables_agree(); }
 
-    static wccp_grp_config config(uint8_t id, const char *interface = "wan0") {
-        wccp_grp_config out = engine_fixture::group_config(id, {"10.0.0.2"});
-        strlcpy(out.interface, interface, sizeof out.interface);
-        return out;
-    }
+    static wccp_grp_config config(uint8_t id) { return engine_fixture::group_config(id, {"10.0.0.2"}); }
     wccp_service_group *add(const wccp_grp_config &with) const { return engine.add_group(with); }
     static int modify(uint8_t id, uint32_t flags, wccp_grp_config update = {}) {
         update.group_id = id;
         update.config_flags = flags;
         return wccp_modify_grp(&update);
     }
-    static wccp_sending_router *add_router(wccp_service_group *group, const std::string &id) {
-        auto *record = static_cast<wccp_sending_router *>(wccp_calloc(1, sizeof(wccp_sending_router)));
-        record->router_id = ipa(id);
-        list_push_head(&group->sending_routers, record);
-        group->sending_router_count++;
-        return record;
+    // By L2 and hash.
+    static wccp_sending_router *add_router(wccp_service_group *group) {
+        const wccp_rtr_capabilities offered = {WCCP_METHOD_L2, WCCP_ASSIGN_HASH, WCCP_METHOD_L2};
+        return wccp_create_sending_router(group, ipa("10.0.0.2"), &offered, &offered);
     }
     engine_fixture engine;
 };
@@ -105,22 +99,6 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
     memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
     EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
-}
-
-TEST_F(Config, AGroupStartsAsFarAsItCan) {
-    // Enabled, on an interface that is not ready: only the connectivity alarm runs.
-    const wccp_service_group *waiting = add(config(10, "absent0"));
-    EXPECT_EQ(std::tuple(waiting->hia_timer.active, waiting->monitor_timer.active,
-                         waiting->router_alarm_timer.active),
-              std::tuple(0, 0, 1));
-    // Disabled, or not configured: no timer runs.
-    for (const uint32_t admin : {WCCP_ADMIN_DOWN + 0u, 0u}) {
-        wccp_grp_config with = config(static_cast<uint8_t>(11 + admin));
-        with.admin = admin;
-        const wccp_service_group *group = add(with);
-        EXPECT_EQ(group->state_flags, WCCP_STATE_INIT);
-        EXPECT_EQ(group->hia_timer.active + group->router_alarm_timer.active, 0);
-    }
 }
 
 TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
@@ -187,32 +165,28 @@ TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
     with.mask_src_ip = 0xf;
     wccp_service_group *group = add(with);
     make_active(group);
-    group->fwd_method = group->assign_method = group->ret_method = 1;
-    group->state_flags |= WCCP_CAPABILITIES_SET;
     group->designated = group->redirecting_routers = group->assign_timer.active = 1;
-    group->change_number = group->dsg_key_change = group->pending_acks = 9;
+    group->dsg_key_change = group->pending_acks = 9;
     group->dsg_appliances[31].weight = 5;
     group->rx_icus = 12;
+    const wccp_rtr_view_appliance seen = {ipa("10.0.0.100"), 100, 0, 0, 0, {}};
+    wccp_update_appliance_view(group, add_router(group), 1, &seen);
     group->router_alarm_timer.countdown = 7;
-    add_router(group, "10.0.0.2")->flags = WCCP_RTR_TWO_WAY;
-    auto *appliance = static_cast<wccp_view_appliance *>(wccp_calloc(1, sizeof(wccp_view_appliance)));
-    list_push_head(&group->appliance_view, appliance);
-    group->appliance_view_count++;
 
     wccp_stop_service_group(group);
     const bytes shutdown = engine.sent_to("10.0.0.2");
     ASSERT_GE(shutdown.size(), 20u);
     EXPECT_EQ(shutdown[3], 10) << "a Here-I-Am";
     EXPECT_EQ(bytes(shutdown.end() - 12, shutdown.end()), (bytes{0, 15, 0, 8, 0, 1, 0, 4, 10, 0, 0, 100}));
-    EXPECT_EQ(group->hia_timer.active + group->assign_timer.active + group->monitor_timer.active, 0);
-    EXPECT_EQ((numbers{group->state_flags, group->fwd_method, group->assign_method, group->ret_method,
-                       group->designated, group->change_number, group->dsg_key_change, group->pending_acks,
-                       group->redirecting_routers, group->dsg_appliances[31].weight,
-                       group->sending_router_count, group->appliance_view_count}),
-              (numbers{WCCP_STATE_INIT, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
-    EXPECT_TRUE(group->rx_icus == 12 && group->weight == 100 && group->mask_bits == 4);
-    EXPECT_TRUE(group->router_alarm_timer.active == 1 && group->router_alarm_timer.countdown == 60);
-
+    EXPECT_EQ(
+        (numbers{group->hia_timer.active, group->assign_timer.active, group->monitor_timer.active,
+                 group->fwd_method, group->assign_method, group->ret_method, group->designated,
+                 group->change_number, group->dsg_key_change, group->pending_acks, group->redirecting_routers,
+                 group->dsg_appliances[31].weight, group->sending_router_count, group->appliance_view_count}),
+        numbers(14, 0));
+    EXPECT_EQ((numbers{group->state_flags, group->rx_icus, group->weight, group->mask_bits,
+                       group->router_alarm_timer.active, group->router_alarm_timer.countdown}),
+              (numbers{WCCP_STATE_INIT, 12, 100, 4, 1, 60}));
     wccp_stop_service_group(group);
     EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{}) << "nothing to withdraw a second time";
     EXPECT_EQ(group->tx_here_i_am, 1u);
@@ -264,9 +238,8 @@ TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
         EXPECT_EQ(wccp_get_grp_info(61, &info), 0);
         EXPECT_STREQ(info.oper, word);
     }
-    group->state_flags = WCCP_STATE_INIT | WCCP_CAPABILITIES_SET;
+    add_router(group);
     group->assign_method = 9;
-    add_router(group, "10.0.0.8");
     wccp_grp_router_info router = {};
     router.router_num = 1;
     EXPECT_EQ(wccp_get_grp_router_info(61, &router), 0);

@@ -116,7 +116,8 @@ struct engine_fixture {
     engine_fixture &operator=(const engine_fixture &) = delete;
 
     // An enabled group without tunnels: L2, either assignment, IOS, weight 100.
-    static wccp_grp_config group_config(uint8_t id, const std::vector<std::string> &routers) {
+    static wccp_grp_config group_config(uint8_t id, const std::vector<std::string> &routers,
+                                        const char *interface = "wan0") {
         wccp_grp_config config = {};
         config.group_id = id;
         for (const std::string &router : routers)
@@ -126,7 +127,7 @@ struct engine_fixture {
         config.fwd_method = WCCP_METHOD_L2;
         config.assign_method = WCCP_ASSIGN_EITHER;
         config.interface_set = 1;
-        strcpy(config.interface, "wan0");
+        strlcpy(config.interface, interface, sizeof config.interface);
         config.compatibility = WCCP_COMPAT_IOS;
         return config;
     }
