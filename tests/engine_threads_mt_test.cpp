@@ -71,9 +71,8 @@ struct Threads : testing::Test {
     }
 
     static wccp_service_group *add_group(uint8_t id, const char *interface) {
-        wccp_grp_config config = engine_fixture::group_config(id, {});
+        wccp_grp_config config = engine_fixture::group_config(id, {}, interface);
         config.fwd_method = WCCP_METHOD_EITHER;
-        strlcpy(config.interface, interface, sizeof config.interface);
         EXPECT_EQ(wccp_add_group(&config), 0);
         return wccp_find_group(id);
     }
@@ -274,6 +273,10 @@ TEST_F(Threads, APacketBetweenStopAndStartChangesNothing) {
         EXPECT_TRUE(seen[0].code == MAILBOX_DELETE_TUNNEL && seen[0].local == to_host(old_address));
     }
     EXPECT_TRUE(joins());
+    wccp_g.seconds += 40; // a router that is silent loses its tunnel, too
+    wccp_monitor_sending_routers(group);
+    const std::vector<seen_command> seen = tunneld->take_commands();
+    EXPECT_TRUE(seen.size() == 1 && seen[0].code == MAILBOX_DELETE_TUNNEL && !group->sending_routers);
 }
 
 // Sets the address of an interface, like "ip" but without a process.
