@@ -117,7 +117,6 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {changed(4, 1), 0, none, "WCCP rxed verion (256) is not supported. sender ip: 10.0.0.1",
          "message-version 10.0.0.1: 0x100|0x200"},
         {changed(3, 10), 0, none, "10.0.0.1", "message-type 10.0.0.1: type 10|11 or 13"}, // a Here-I-Am
-        {changed(3, 12), 0, none, "10.0.0.1", "message-type"},                            // a Redirect-Assign
         {changed(0, 1), 0, none, "10.0.0.1", "message-type"}, // a type of more than 16 bits
         {with({}), 1, all, "WCCP: unloading security info failed."},
         {with({security}), 1, all, "WCCP: unloading service info failed."},
@@ -143,10 +142,7 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {optional({hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
         {optional({hex("0008 0004 00000000")}), 0, bad_icu, "WCCP: unloading capability comp. failed."},
         {optional({hex("0063 0001")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
-        {optional({hex("00")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
         {optional({hex("0063")}), 0, bad_icu, "component type: 99 length 0 "},
-        {optional({hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
-        {optional({hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {optional({by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
          "WCCP GRP 51: ICU bogus packet  (too many optional components).",
          "message-malformed 10.0.0.1: 4 optional components|3 at most"},
@@ -175,7 +171,10 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         log.take();
         EXPECT_EQ(process(row.message), row.result);
         EXPECT_EQ(now(), expected);
-        EXPECT_EQ(group->sending_routers, nullptr);
+        EXPECT_EQ((numbers{group->sending_router_count, group->router_view_count, group->appliance_view_count,
+                           group->change_number, group->fwd_method, group->state_flags}),
+                  (numbers{0, 0, 0, 0, 0, WCCP_STATE_INIT}))
+            << "the group is unchanged";
         const std::string reasons = take_reasons(group) + take_reasons(nullptr);
         EXPECT_NE(reasons.find(row.reason), std::string::npos) << reasons;
         EXPECT_EQ(reasons.empty(), row.reason.empty()) << reasons;
@@ -184,13 +183,12 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         EXPECT_EQ(count_of("processing received packet from 10.0.0.1 failed", lines), row.result);
     }
     const numbers before = now();
-    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
-        group->admin_state = state;
-        EXPECT_TRUE(process(good) == 0 && log.say("WCCP GRP 51: is disabled. dropping the rxed packet."));
+    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u, WCCP_ADMIN_UP + 0u}) {
         EXPECT_EQ(now(), before);
+        group->admin_state = state;
+        EXPECT_EQ(process(good), 0);
+        EXPECT_EQ(log.say("GRP 51: is disabled. dropping the rxed packet."), state != WCCP_ADMIN_UP);
     }
-    group->admin_state = WCCP_ADMIN_UP;
-    EXPECT_EQ(process(good), 0);
     EXPECT_NE(router(1), nullptr) << "the message itself is valid";
 }
 
@@ -243,17 +241,16 @@ TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
         seen.push_back({100, weight, 0});
         return make_icu(id, view(id, seen), {by_mask});
     };
-    process(report(1, 100));
-    process(report(2, 100));
+    for (const uint32_t id : {1u, 2u})
+        process(report(id, 100));
     group->mask_bits = WCCP_MAX_MASK_BITS + 1;
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
-    const uint32_t appliances = group->appliance_view_count;
     const std::pair<const char *, std::function<bytes(uint32_t)>> rows[] = {
         {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }},
         {"is not in all sending router views",
          [&](uint32_t i) {
-             return report(1, i % 2 + 1, {{101 + i % 100, 1, 0}});
+             return report(1, i % 2 + 1, std::vector{element{101 + i % 100, 1, 0}});
          }},
         {"failed to add tunnel",
          [this](uint32_t i) {
@@ -281,34 +278,6 @@ TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
         EXPECT_GT(with_line, 50) << line;
         EXPECT_LE(lines, 200) << line;
     }
-    group->appliance_view_count = appliances;
-}
-
-TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
-    process(make_icu(2, view(2, {{100, 100, 0xff}})));
-    const wire_bytes seen = view(1, {{100, 100, 0x11}, {101, 50, 0x22}});
-    const bytes whole = make_icu(1, seen, {by_hash, odd_command, map_part({100, 101})});
-    const size_t mandatory = 8 + 8 + 28 + 24 + seen.size();
-    size_t refused = 0;
-    for (size_t length = 44; length < whole.size(); length++) {
-        const size_t optional = length - mandatory; // a message may end where an optional component does
-        if (length >= mandatory &&
-            (optional == 0 || optional == by_hash.size() || optional == by_hash.size() + 17))
-            continue;
-        bytes cut(whole.begin(), whole.begin() + static_cast<long>(length));
-        cut[6] = static_cast<uint8_t>((length - 8) >> 8);
-        cut[7] = static_cast<uint8_t>(length - 8);
-        const auto before = std::make_unique<wccp_service_group>(*group);
-        const wccp_sending_router router_before = *router(2);
-        EXPECT_EQ(process(cut), 0);
-        before->rx_icus++;
-        before->rx_icu_failures++;
-        memcpy(before->reasons, group->reasons, sizeof group->reasons);
-        EXPECT_EQ(memcmp(before.get(), group, sizeof *group), 0) << length;
-        EXPECT_EQ(memcmp(&router_before, router(2), sizeof router_before), 0) << length;
-        refused++;
-    }
-    EXPECT_TRUE(refused > 200 && process(whole) == 0 && router(1));
 }
 
 TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
