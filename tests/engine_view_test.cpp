@@ -128,17 +128,6 @@ TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
     EXPECT_EQ(views(), "| 0.1/150:2 0.3/100:2 +2");
 }
 
-TEST_F(ViewTest, WithoutBucketsTheEarlierBitsStay) {
-    wccp_rtr_view_appliance decoded[WCCP_MAX_APPLIANCES] = {};
-    wccp_sending_router *a = router(ROUTER_A);
-    for (const auto &each :
-         {wccp_rtr_view_appliance{US, 100, 0, 1, 256, {0, 0, 0, 8}}, {US, 100, 0, 0, 0, {}}}) {
-        decoded[0] = each;
-        wccp_update_appliance_view(group, a, 1, decoded);
-    }
-    EXPECT_TRUE(a->view_appliances[0].buckets_assigned == 0 && a->view_appliances[0].bucket_bits[3] == 8);
-}
-
 // What a router assigns to this appliance and to all; then the number of routers that redirect here, the
 // state, and the log line.
 TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
