@@ -63,8 +63,8 @@ TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
         ASSERT_EQ(group->ucast_router_count, unicast);
         for (size_t i = 0; i < unicast; i++)
             EXPECT_EQ(group->ucast_routers[i], ipa(given[i]));
-        EXPECT_EQ(group->mcast_ipa, ipa(multicast));
-        EXPECT_EQ(group->mcast_configured, !is_zero(group->mcast_ipa));
+        EXPECT_EQ(std::pair(group->mcast_ipa, group->mcast_configured != 0),
+                  std::pair(ipa(multicast), multicast != std::string("0.0.0.0")));
     }
     wccp_grp_config full = config(id);
     full.router_count = 65535; // more than there is room for
@@ -106,14 +106,26 @@ TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
     const std::tuple<uint32_t, bool, uint32_t> steps[] = {
         {1, false, 1}, {7, true, 2}, {2, false, 2}, {1, true, 1}};
     for (const auto &[admin, changes, state] : steps) {
-        wccp_grp_config update = {};
-        update.admin = admin;
         group->change_number = 5;
-        EXPECT_EQ(modify(61, WCCP_CFG_ADMIN, update), 0);
+        engine.set_admin(61, admin);
         EXPECT_EQ(std::tuple(group->admin_state, group->change_number, group->hia_timer.active),
                   std::tuple(state, changes ? 0 : 5, state == 1));
-        EXPECT_EQ(modify(99, WCCP_CFG_ADMIN, update), 0) << "a missing group is not a failure here";
+        engine.set_admin(99, admin); // a missing group is not a failure here
     }
+    // Stopping all skips disabled groups.
+    wccp_service_group *down = add(config(2)), *unset = add(config(3));
+    down->admin_state = WCCP_ADMIN_DOWN;
+    unset->admin_state = 0;
+    group->change_number = down->change_number = unset->change_number = 3;
+    EXPECT_EQ(wccp_stop_all_service_groups(), 0);
+    engine.set_admin(3, 0); // disabled once more
+    EXPECT_EQ((numbers{group->change_number, down->change_number, unset->change_number, group->admin_state,
+                       unset->admin_state}),
+              (numbers{0, 3, 3, WCCP_ADMIN_UP, 0}));
+    // Without an address nothing starts.
+    engine.interface->ready_flags = WCCP_LINK_READY;
+    wccp_start_service_groups_by_interface(engine.interface);
+    EXPECT_EQ(group->hia_timer.active, 0);
 }
 
 // tests/daemon_config_test.cpp has the update of each field.
@@ -207,26 +219,6 @@ TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
     EXPECT_TRUE(wccp_del_group(3 + 256) == 0 && wccp_del_all_groups() == 0);
     for (const uint8_t id : {uint8_t{3}, uint8_t{0}, uint8_t{5}, uint8_t{255}})
         EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "in ascending order of ids";
-}
-
-// engine_network_test has the groups that follow their interface.
-TEST_F(Config, StoppingAllSkipsDisabledGroups) {
-    wccp_service_group *up = add(config(1)), *down = add(config(2)), *unset = add(config(3));
-    down->admin_state = WCCP_ADMIN_DOWN;
-    unset->admin_state = 0;
-    up->change_number = down->change_number = unset->change_number = 3;
-    EXPECT_EQ(wccp_stop_all_service_groups(), 0);
-    EXPECT_TRUE(up->change_number == 0 && up->admin_state == WCCP_ADMIN_UP);
-    engine.interface->ready_flags = WCCP_LINK_READY;
-    wccp_start_service_groups_by_interface(engine.interface);
-    EXPECT_EQ(up->hia_timer.active, 0);
-    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN), 0); // disabled once more
-    EXPECT_EQ((numbers{unset->admin_state, down->change_number, unset->change_number}), (numbers{0, 3, 3}));
-    engine.interface->ready_flags = WCCP_ALL_READY;
-    wccp_grp_config enabled = {};
-    enabled.admin = WCCP_ADMIN_UP;
-    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN, enabled), 0);
-    EXPECT_TRUE(unset->admin_state == WCCP_ADMIN_UP && unset->hia_timer.active == 1);
 }
 
 // What the tests of the monitoring tree cannot see of the queries.

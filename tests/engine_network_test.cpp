@@ -17,6 +17,7 @@
 #include "platform/limits.h"
 #include "tests/support/engine_fixture.h"
 #include "tests/support/reported_group.h"
+#include "tests/support/test_host.h"
 
 static std::function<void()> after_wait; // called once, when a descriptor is ready
 
@@ -110,13 +111,11 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
             return;
         }
         owner = socket(AF_INET, SOCK_DGRAM, 0);
-        const sockaddr_in port = {AF_INET, htons(2048), {address_word("10.0.0.100")}, {}};
-        for (int shared : {1, 0}) {
-            EXPECT_EQ(setsockopt(owner, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared), 0);
-            if (shared) {
-                EXPECT_EQ(bind(owner, reinterpret_cast<const sockaddr *>(&port), sizeof port), 0);
-            }
-        }
+        int shared = 1;
+        setsockopt(owner, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared);
+        EXPECT_EQ(bind_to(owner, to_host(ipa("10.0.0.100")), 2048), 0);
+        shared = 0;
+        setsockopt(owner, SOL_SOCKET, SO_REUSEADDR, &shared, sizeof shared);
     };
     const auto take_descriptors = [](bool on) {
         rlimit limit;
@@ -133,11 +132,6 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     wccp_service_group *known = live_group();
     const wccp_grp_config unicast = engine_fixture::group_config(61, {"10.0.0.2"}),
                           multicast = engine_fixture::group_config(62, {"224.0.1.62"});
-    auto set_admin = [update = unicast](uint32_t state) mutable {
-        update.config_flags = WCCP_CFG_ADMIN;
-        update.admin = state;
-        EXPECT_EQ(wccp_modify_grp(&update), 0);
-    };
     const std::pair<const char *, std::function<void()>> occasions[] = {
         {"thirty seconds", [] { pass_seconds(30); }},
         {"a link notification", [] { notify_link("wan0", 1, 1); }},
@@ -155,8 +149,8 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
         {"a group is enabled",
          [&] {
              pass_seconds(1);
-             set_admin(WCCP_ADMIN_DOWN);
-             set_admin(WCCP_ADMIN_UP);
+             engine.set_admin(61, WCCP_ADMIN_DOWN);
+             engine.set_admin(61, WCCP_ADMIN_UP);
          }},
     };
     for (const auto &cause : causes)
@@ -197,20 +191,20 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     // Not when no group needs it.
     known = wccp_find_group(61);
     wan->network_flaws = WCCP_FLAW_SOCKETS;
-    struct stat before = {}, after = {};
-    fstat(wan->ucast_fd, &before);
-    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
-        known->admin_state = state;
+    for (const auto &[admin, ready] : {std::pair{0u, WCCP_ALL_READY},
+                                       {+WCCP_ADMIN_DOWN, WCCP_ALL_READY},
+                                       {+WCCP_ADMIN_UP, WCCP_IPA_READY}}) {
+        known->admin_state = admin;
+        wan->ready_flags = ready;
         pass_seconds(31);
+        EXPECT_EQ(wan->network_flaws, +WCCP_FLAW_SOCKETS);
     }
-    known->admin_state = WCCP_ADMIN_UP;
-    wan->ready_flags = WCCP_IPA_READY;
-    pass_seconds(31);
-    EXPECT_EQ(wan->network_flaws, WCCP_FLAW_SOCKETS + 0u);
 
     // For a failed join the sockets are kept.
     wan->ready_flags = WCCP_ALL_READY;
     wan->network_flaws = 0;
+    struct stat before = {}, after = {};
+    fstat(wan->ucast_fd, &before);
     EXPECT_EQ(wccp_add_group(&multicast), 0);
     run_command("echo 1 >/proc/sys/net/ipv4/igmp_max_memberships");
     wccp_grp_config other = engine_fixture::group_config(63, {"224.0.1.63"});
@@ -225,10 +219,9 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
 
 TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     EXPECT_EQ(wccp_join_mc_grp(bare("closed0"), ipa("224.0.1.5")), 1);
-    // Without an address nothing is joined, since the kernel would choose another interface.
+    // Without an address the kernel would choose another interface.
     wan->ipa = {};
-    EXPECT_EQ(wccp_join_mc_grp(wan, ipa("224.0.1.5")), 1);
-    EXPECT_EQ(wan->mcast_bound, 0u);
+    EXPECT_TRUE(wccp_join_mc_grp(wan, ipa("224.0.1.5")) == 1 && wan->mcast_bound == 0);
     wan->ipa = ipa("10.0.0.100");
     log_lines log;
     for (const char *address : {"224.0.1.5", "224.0.1.5", "224.0.1.6", "224.0.1.6"})
@@ -240,16 +233,6 @@ TEST_F(Network, JoiningBindsOnceAndRepeatsWithoutHarm) {
     EXPECT_EQ(bound_to(wan->mcast_fd), "224.0.1.5:2048");
     run_command("ip maddr show dev wan0 | grep -q 224.0.1.6");
     EXPECT_EQ(wccp_join_mc_grp(wan, ipa("10.0.0.1")), 1);
-
-    // New sockets join the addresses of their groups, and can be bound to another one.
-    wccp_service_group silent = {};
-    wccp_if_add_group(&silent, wan);
-    wccp_if_add_group(&group, wan);
-    group.mcast_configured = 1;
-    group.mcast_ipa = ipa("224.0.1.7");
-    ASSERT_EQ(wccp_init_network_by_interface(wan), 0);
-    EXPECT_EQ(bound_to(wan->mcast_fd), "224.0.1.7:2048");
-    wan->groups = nullptr;
 }
 
 TEST_F(Network, SocketsCarryTheirOptions) {
@@ -278,25 +261,26 @@ TEST_F(Network, APacketIsSentToTheDestinationsOfTheGroup) {
     const std::vector<uint8_t> expected(120, 0x5a), nothing;
     for (const char *router : {"10.0.0.2", "10.0.0.3"})
         engine.router_socket(router);
+    const auto received = [this] {
+        return std::pair(engine.sent_to("10.0.0.2"), engine.sent_to("10.0.0.3"));
+    };
     engine.peer.run("ip route add 224.0.0.0/4 dev peer0");
     const int listener = engine.sockets["224.0.1.5"] = engine.peer.udp_socket("224.0.1.5", 2048);
     const ip_mreq membership = {{address_word("224.0.1.5")}, {address_word("10.0.0.2")}};
     ASSERT_EQ(setsockopt(listener, IPPROTO_IP, IP_ADD_MEMBERSHIP, &membership, sizeof membership), 0);
 
     wccp_pkt pkt = packet(120, 0x5a);
-    EXPECT_EQ(wccp_tx_pkt(nullptr, &pkt) + wccp_tx_pkt(&group, nullptr), 0);
-    EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "no interface";
+    EXPECT_EQ(wccp_tx_pkt(nullptr, &pkt) + wccp_tx_pkt(&group, nullptr) + wccp_tx_pkt(&group, &pkt), 0);
     group.interfaces[0] = wan;
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 0) << "no destination";
     for (const char *router : {"10.0.0.2", "10.0.0.3"})
         group.ucast_routers[group.ucast_router_count++] = ipa(router);
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 240);
     EXPECT_EQ(pkt.ipa, ipa("10.0.0.3"));
-    for (const char *router : {"10.0.0.2", "10.0.0.3"})
-        EXPECT_EQ(engine.sent_to(router), expected);
+    EXPECT_EQ(received(), std::pair(expected, expected));
     pkt.ipa = ipa("10.0.0.2");
     EXPECT_EQ(wccp_tx_pkt(&group, &pkt), 120) << "the packet's own address comes first";
-    EXPECT_EQ(engine.sent_to("10.0.0.2"), expected);
+    EXPECT_EQ(received(), std::pair(expected, nothing));
 
     // With a multicast address nothing is sent to unicast routers.
     pkt.ipa = {};
@@ -309,8 +293,7 @@ TEST_F(Network, APacketIsSentToTheDestinationsOfTheGroup) {
     EXPECT_EQ(pkt.ipa, group.mcast_ipa);
     const datagram got = receive_datagram(listener);
     EXPECT_TRUE(got.bytes == expected && got.from == "10.0.0.100");
-    for (const char *router : {"10.0.0.2", "10.0.0.3"})
-        EXPECT_EQ(engine.sent_to(router), nothing);
+    EXPECT_EQ(received(), std::pair(nothing, nothing));
 
     // Results of sendto are returned, and added up over the routers.
     group.mcast_configured = 0;
