@@ -14,11 +14,6 @@ namespace {
 using bytes = std::vector<uint8_t>;
 using numbers = std::vector<uint32_t>;
 
-be32 make_ipa(uint8_t third, uint8_t fourth) {
-    return {{10, 0, third, fourth}};
-}
-const be32 SENDER = make_ipa(0, 1);
-
 const wire_bytes security = security_info();
 wire_bytes service_part(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6,
                         uint32_t flags = 0x13) {
@@ -76,10 +71,10 @@ struct Messages : testing::Test {
         group->protocol = 6;
         group->service_flags = 0x13;
     }
-    static int process(const bytes &message, be32 from = SENDER) {
+    static int process(const bytes &message, be32 from = host(1)) {
         return wccp_process_received_packet(make_received(message, from).get());
     }
-    wccp_sending_router *router(uint8_t id) const { return wccp_find_sending_router(group, make_ipa(0, id)); }
+    wccp_sending_router *router(uint32_t id) const { return wccp_find_sending_router(group, host(id)); }
     engine_fixture engine;
     wccp_service_group *group = nullptr;
 };
@@ -98,6 +93,9 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         return out;
     };
     const auto with = [](const std::vector<wire_bytes> &components) { return wire_message(11, components); };
+    const auto service = [&](uint32_t priority, uint32_t protocol, uint32_t flags) {
+        return with({security, service_part(51, priority, protocol, flags), identity_part(1)});
+    };
     const auto optional = [](const std::vector<wire_bytes> &more) { return make_icu(1, view(1, {}), more); };
     bytes longer = good, router_0 = make_icu(0, view(1, {}));
     longer.push_back(0);
@@ -127,17 +125,14 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {with({security, service_part()}), 0, bad_icu, "WCCP: unloading router identity failed."},
         {with({security, service_part(), identity_part(1)}), 0, bad_icu,
          "WCCP: unloading router view failed."},
-        {with({security, service_part(51, 201, 17, 3), identity_part(1)}), 0, bad_service,
+        {service(201, 17, 3), 0, bad_service,
          "WCCP GRP 51: service group config mismatch (router id: 10.0.0.1) .priority: rxed = 201 local = "
          "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13",
          "service-mismatch 10.0.0.1: priority 201, protocol 17, flags 0x3|priority 200, protocol 6, flags "
          "0x13"},
-        {with({security, service_part(51, 199), identity_part(1)}), 0, bad_service, "config mismatch",
-         "service-"},
-        {with({security, service_part(51, 200, 17), identity_part(1)}), 0, bad_service, "mismatch",
-         "service-"},
-        {with({security, service_part(51, 200, 6, 0x80000013), identity_part(1)}), 0, bad_service,
-         "config mismatch"},
+        {service(199, 6, 0x13), 0, bad_service, "config mismatch", "service-"},
+        {service(200, 17, 0x13), 0, bad_service, "config mismatch", "service-"},
+        {service(200, 6, 0x80000013), 0, bad_service, "config mismatch"},
         {optional({hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {optional({hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
         {optional({hex("0008 0004 00000000")}), 0, bad_icu, "WCCP: unloading capability comp. failed."},
@@ -285,7 +280,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     constexpr uint32_t L2 = WCCP_METHOD_L2, HASH = WCCP_ASSIGN_HASH;
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
     // Odd lengths put the capabilities at odd addresses.
-    EXPECT_EQ(process(make_icu(1, seen, {odd_unknown, odd_command, by_hash}), make_ipa(7, 7)), 0);
+    EXPECT_EQ(process(make_icu(1, seen, {odd_unknown, odd_command, by_hash}), host(7 << 8 | 7)), 0);
     EXPECT_EQ(take_reasons(group), "");
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
@@ -298,7 +293,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
                        group->rx_icu_failures};
     };
     EXPECT_EQ(now(), (numbers{0xa1a2a3a4, 0xc1c2c3c4, 77, 1, 2, 32, 256, L2, HASH, 0, 0}));
-    EXPECT_EQ(made->src_ipa, make_ipa(7, 7));
+    EXPECT_EQ(made->src_ipa, host(7 << 8 | 7));
     EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY && group->state_flags & WCCP_STATE_ACTIVE);
     // Another service is only counted.
     wccp_g.seconds = 78;
@@ -312,9 +307,8 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     const std::vector<uint32_t> owners = {100, 100, 101, 102, 102, 100, 101, 101, 101, 100};
     EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map_part(owners), by_mask})),
               0);
-    EXPECT_EQ(take_reasons(group),
-              "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst 0x0 "
-              "ports 0x0 0x0");
+    EXPECT_EQ(take_reasons(group), "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst "
+                                   "0x0 ports 0x0 0x0");
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
     const auto bits = [made](uint32_t entry) {
@@ -333,8 +327,9 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     group->mask_src_ip = 0x41;
     group->mask_dst_ip = 0x100;
     group->mask_src_port = group->mask_dst_port = 0;
-    for (const auto &[values, in_order] : std::vector<std::pair<numbers, bool>>{
-             {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}}) {
+    const std::pair<numbers, bool> orders[] = {
+        {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}};
+    for (const auto &[values, in_order] : orders) {
         wire_bytes ordered = hex("000e 0000 00000001 00000041 00000100 00000000");
         ordered.u32(static_cast<uint32_t>(values.size()));
         for (const uint32_t value : values) // one bit of the source and one of the destination
@@ -362,21 +357,6 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     process(make_icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
     EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
                                    "not-in-view 10.0.0.2: 1 appliance|10.0.0.100");
-}
-
-TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
-    const size_t room = WCCP_MAX_PACKET - make_icu(1, mask_view(1, {100, 101}), {by_mask}).size() - 24;
-    std::vector<uint32_t> owners(room / 16 - 1, 101);
-    owners.back() = 100;
-    const size_t rest = room - owners.size() * 16 - 4;
-    const wire_bytes filler = hex("0063").u16(static_cast<uint32_t>(rest)).zeros(rest);
-    bytes message = make_icu(1, mask_view(1, {100, 101}), {by_mask, map_part(owners), filler});
-    ASSERT_EQ(message.size(), size_t{WCCP_MAX_PACKET});
-    ASSERT_TRUE(process(message) == 0 && router(1));
-    EXPECT_EQ(std::tuple(router(1)->self_buckets, router(1)->total_buckets, group->rx_icu_failures),
-              std::tuple(1, owners.size(), 0));
-    message[7]++; // the header of a longer message, truncated to the buffer: dropped and not counted
-    EXPECT_TRUE(process(message) == 0 && group->rx_icus == 1 && wccp_g.rx_failures == 0);
 }
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
@@ -431,19 +411,18 @@ TEST_F(Messages, TheDigestDecides) {
     EXPECT_EQ(process(good), 1);
     group->security_option = 0;
     EXPECT_EQ(process(good), 1);
-    const std::string reasons = "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
-                                "security-unwanted 10.0.0.1: MD5|none";
-    EXPECT_EQ(take_reasons(group), reasons);
+    EXPECT_EQ(take_reasons(group), "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
+                                   "security-unwanted 10.0.0.1: MD5|none");
     // An accepted I-See-You ends them, except those of the same second and those of other senders.
-    EXPECT_TRUE(process(good) == 1 && process(good, make_ipa(0, 2)) == 1);
+    EXPECT_TRUE(process(good) == 1 && process(good, host(2)) == 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
         process(make_icu(1, view(1, {{100, 100, 0}})));
     EXPECT_EQ(take_reasons(group),
               "security-unwanted 10.0.0.2: MD5|none; assignment-not-offered 10.0.0.1: hash|mask x2");
     // Reasons of strangers replace those of strangers, not those of the group's routers.
     EXPECT_EQ(process(good), 1);
-    for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
-        process(good, make_ipa(7, i));
+    for (uint32_t i = 0; i < 100; i++, wccp_g.seconds++)
+        process(good, host(7 << 8 | i));
     const std::string all = take_reasons(group);
     EXPECT_EQ(count_of("unwanted 10.0.0.1: ", all) + count_of("10.0.7.99:", all), 2) << all;
     EXPECT_EQ(count_of("10.0.7.0:", all), 0) << all;
@@ -478,9 +457,8 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
     }
     engine.interface->ready_flags = WCCP_ALL_READY;
     group->tx_pkt->ipa = {{255, 255, 255, 255}}; // refused by the kernel: only a result of 0 is a failure
-    EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 25), 0);
-    EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);
-    EXPECT_TRUE(group->tx_removal_replies == 1 && group->tx_failures == 3);
+    EXPECT_TRUE(wccp_transmit_packet(group, group->tx_pkt, 25) == 0 && group->tx_removal_replies == 1);
+    EXPECT_TRUE(wccp_transmit_packet(group, nullptr, 10) == 1 && group->tx_failures == 3);
     EXPECT_EQ(take_reasons(group), "table-not-built: redirect assign: groups actual assignment method is "
                                    "not set.|; send-failed 255.255.255.255: Permission denied|108 bytes");
     EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});
