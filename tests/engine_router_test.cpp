@@ -60,26 +60,26 @@ TEST_F(RouterTest, RefusalsAndRoutersAreLogged) {
     const std::string refused = "incompatible capabilities (router id 10.0.0.201) : local";
     configure(WCCP_METHOD_L2, WCCP_ASSIGN_MASK);
     decide(0xfd, 3, 2);
-    logs({refused + ": (fwd encap: L2 ) router sent: (fwd: gre return: L2)"});
     decide(3, 1, 3);
-    logs({refused + " assign method: mask  router assign method: hash"});
     decide(3, 3, 0);
-    logs({refused + " return method: gre or L2  router return method: none"});
+    logs({refused + ": (fwd encap: L2 ) router sent: (fwd: gre return: L2)",
+          refused + " assign method: mask  router assign method: hash",
+          refused + " return method: gre or L2  router return method: none"});
     EXPECT_EQ(take_reasons(group), "forwarding-not-offered 10.0.0.201: gre|L2; assignment-not-offered "
                                    "10.0.0.201: hash|mask; return-not-offered 10.0.0.201: none|gre or L2");
-    const wccp_rtr_capabilities agreed = {2, 1, 2};
-    wccp_create_sending_router(group, ROUTER_A, &agreed, &agreed);
+    router(ROUTER_A);
     logs({"agreed capabilities: fwd: 2 assign: 1 return: 2 deciding rtr id 10.0.0.201",
           "alarm: schedule router connectivity verify timer in 60 seconds",
           "created ICU sending router 10.0.0.201 "});
+    const wccp_rtr_capabilities agreed = {2, 1, 2};
     wccp_create_sending_router(group, {}, &agreed, &agreed);
-    logs({"invalid router id in ICU. 0.0.0.0"});
     uint32_t buckets;
     wccp_get_router_assignment(group, router(ROUTER_A), host(3), &buckets);
-    logs({"get router assign. failed. cannot find appliance 10.0.0.3 in router's view: 10.0.0.201"});
     wccp_g.seconds += 40;
     wccp_monitor_sending_routers(group);
-    logs({"removing router (router id: 10.0.0.201) due to inactivity."});
+    logs({"invalid router id in ICU. 0.0.0.0",
+          "get router assign. failed. cannot find appliance 10.0.0.3 in router's view: 10.0.0.201",
+          "removing router (router id: 10.0.0.201) due to inactivity."});
     EXPECT_EQ(take_reasons(group), "router-id-zero: |; router-silent 10.0.0.201: |an I-See-You within 40 s");
 }
 

@@ -31,14 +31,8 @@ struct Tunnels : testing::Test {
         tunneld.answer_with(tunneld_does);
         EXPECT_EQ(wccp_del_all_tunnels(), 0);
         EXPECT_EQ(wccp_g.stat_allocs - wccp_g.stat_frees, allocated) << "every record is freed";
-        // All 32 ids are free again.
-        tunneld.take_commands();
-        std::set<uint16_t> ids;
         for (uint32_t i = 0; i < 32; i++)
-            EXPECT_EQ(wccp_add_tunnel(1, self, router_address(i)), 0);
-        for (const seen_command &command : tunneld.take_commands())
-            ids.insert(command.tunnel_id);
-        EXPECT_EQ(ids.size(), 32u);
+            EXPECT_EQ(wccp_add_tunnel(1, self, router_address(i)), 0) << "all ids are free again";
         wccp_del_all_tunnels();
     }
     std::vector<seen_command> commands() { return tunneld.take_commands(); }
@@ -147,11 +141,10 @@ TEST_F(Tunnels, DeletingAllWhileOthersAddAndDelete) {
     std::vector<std::thread> others;
     for (uint32_t other = 0; other < 3; other++)
         others.emplace_back([other, &stop, &torn] {
-            while (!stop) {
-                for (uint32_t i = 0; i < 8; i++)
-                    torn += wccp_add_tunnel(other, self, router_address(100 + other * 20 + i)) != 0;
-                for (uint32_t i = 0; i < 8; i++)
-                    torn += wccp_del_tunnel(other, self, router_address(100 + other * 20 + i), 0) != 0;
+            for (uint32_t i = 0; !stop; i++) {
+                const be32 router = router_address(100 + other * 20 + i % 8);
+                torn += i / 8 % 2 ? wccp_del_tunnel(other, self, router, 0)
+                                  : wccp_add_tunnel(other, self, router);
             }
         });
     for (int i = 0; i < 10; i++)
