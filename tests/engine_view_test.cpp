@@ -37,6 +37,7 @@ TEST_F(ViewTest, ReportsUpdateTheUnion) {
     const be32 A = ROUTER_A, B = ROUTER_B;
     const be32 low = host(2), high = host(0x101);
     EXPECT_EQ(wccp_appliance_is_reported_by_all_senders(group, US), 1) << "there are none";
+    group->ucast_router_count = 1;
     const std::tuple<be32, std::vector<be32>, reported_appliances, const char *> steps[] = {
         // Only the head is compared in a sorted insertion.
         {A,
@@ -72,11 +73,18 @@ TEST_F(ViewTest, ReportsUpdateTheUnion) {
         {A, {}, {{low, 9}, {US, 8}}, "| 0.1/8:2 0.2/5:2 +0"},
     };
     for (const auto &[from, routers, appliances, wanted] : steps) {
+        const wccp_sending_router *sender = router(from);
+        const uint32_t earlier = sender->flags;
+        group->raised_alarms = 0;
+        wccp_g.seconds++;
         see(from, routers, appliances);
         EXPECT_EQ(views(), wanted);
-        EXPECT_EQ((router(A)->flags & WCCP_RTR_TWO_WAY) != 0,
-                  wccp_get_router_appliance_view_element(router(A), US) != nullptr);
+        const bool listed = wccp_get_router_appliance_view_element(router(from), US) != nullptr;
+        EXPECT_EQ(sender->flags, listed ? WCCP_RTR_TWO_WAY : WCCP_RTR_ONE_WAY);
+        EXPECT_EQ(sender->state_time == wccp_g.seconds, sender->flags != earlier);
+        EXPECT_EQ(group->raised_alarms, !listed && sender->flags != earlier ? WCCP_ALARM_ADJACENCY : 0);
     }
+    wccp_g.seconds = 0;
     // A duplicate entry is logged and inserted after the head.
     auto *again = static_cast<wccp_view_appliance *>(wccp_malloc(sizeof(wccp_view_appliance)));
     again->ipa = US;
@@ -85,24 +93,6 @@ TEST_F(ViewTest, ReportsUpdateTheUnion) {
     EXPECT_EQ(group->appliance_view->next, again);
     list_unlink(again);
     wccp_free(again);
-}
-
-TEST_F(ViewTest, ARouterIsTwoWayWhileItListsThisAppliance) {
-    group->ucast_router_count = 1;
-    const wccp_sending_router *a = router(ROUTER_A);
-    const std::tuple<reported_appliances, uint32_t, uint32_t, uint16_t> steps[] = {
-        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 0, 0},
-        {{{host(2), 1}, {US, 1}}, WCCP_RTR_TWO_WAY, 110, 0},
-        {{{US, 1}, {host(2), 1}}, WCCP_RTR_TWO_WAY, 110, 0},
-        {{{host(2), 1}}, WCCP_RTR_ONE_WAY, 130, WCCP_ALARM_ADJACENCY}};
-    wccp_g.seconds = 100;
-    for (const auto &[list, flags, time, alarms] : steps) {
-        report(ROUTER_A, list);
-        EXPECT_EQ(std::tuple(a->flags, a->state_time, group->raised_alarms), std::tuple(flags, time, alarms));
-        EXPECT_EQ(a->view_appliances[0].ipa, list[0].first) << "in the order of the report";
-        wccp_g.seconds += 10;
-    }
-    wccp_g.seconds = 0;
 }
 
 TEST_F(ViewTest, AWeightChangeMakesTheDesignatedApplianceAssignAgain) {
