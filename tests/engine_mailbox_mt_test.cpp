@@ -107,28 +107,21 @@ TEST_F(Mailbox, WithoutMemoryAMembershipIsRefusedAndTheRestStays) {
 }
 #endif
 
+// tests/engine_tunnel_mt_test.cpp has the other answers.
 TEST_F(Mailbox, AnswersComeBackAsTheyWereGiven) {
-    // The results of an add and of the others, and the index.
-    static const std::tuple<tunneld_answer, int, int, uint32_t> cases[] = {
-        {{0, 77}, 0, 0, 77},
-        {{1, 77}, 1, 1, 77},
-        {{5, 78}, 5, 5, 78},
-        {{0, WCCP_NO_INDEX}, 1, 0, WCCP_NO_INDEX}};
-    mailbox_put(wccp_mailbox->l2_group, uint8_t{255});
-    mailbox_put(wccp_mailbox->l2_value, 0xABCD1234);
-    for (const auto &[answer, add, other, last] : cases) {
-        fake_tunneld tunneld([&given_answer = answer](const seen_command &) { return given_answer; });
-        uint32_t index = WCCP_NO_INDEX;
-        EXPECT_EQ(wccp_add_tunnel_encap(300, {{0x0A000001, 0}}, {{0xFFFFFFFE, 0}}, &index), add);
-        EXPECT_EQ(std::exchange(index, 4u), last);
-        EXPECT_EQ(wccp_del_tunnel_encap(65534, {{0x0A000001, 0}}, {{0xC0A80001, 0}}, &index), other);
-        EXPECT_TRUE(index == last && wccp_set_L2_return(255, 0xABCD1234) == other);
-        // What is not an input of a command is unchanged.
-        EXPECT_EQ(tunneld.take_commands(),
-                  (std::vector<seen_command>{{2, 300, 0x0A000001, 0xFFFFFFFE, WCCP_NO_INDEX, 255, 0xABCD1234},
-                                             {1, 65534, 0x0A000001, 0xC0A80001, 4, 255, 0xABCD1234},
-                                             {3, 65534, 0x0A000001, 0xC0A80001, last, 255, 0xABCD1234}}));
-    }
+    fake_tunneld tunneld([](const seen_command &) { return tunneld_answer{5, 78}; });
+    mailbox_put(wccp_mailbox->l2_group, uint8_t{7});
+    mailbox_put(wccp_mailbox->l2_value, 8u);
+    uint32_t index = WCCP_NO_INDEX;
+    EXPECT_EQ(wccp_add_tunnel_encap(300, {{0x0A000001, 0}}, {{0xFFFFFFFE, 0}}, &index), 5);
+    EXPECT_EQ(std::exchange(index, 4u), 78u);
+    EXPECT_EQ(wccp_del_tunnel_encap(65534, {{0x0A000001, 0}}, {{0xC0A80001, 0}}, &index), 5);
+    EXPECT_TRUE(index == 78 && wccp_set_L2_return(255, 0xABCD1234) == 5);
+    // What is not an input of a command is unchanged.
+    EXPECT_EQ(tunneld.take_commands(),
+              (std::vector<seen_command>{{2, 300, 0x0A000001, 0xFFFFFFFE, WCCP_NO_INDEX, 7, 8},
+                                         {1, 65534, 0x0A000001, 0xC0A80001, 4, 7, 8},
+                                         {3, 65534, 0x0A000001, 0xC0A80001, 78, 255, 0xABCD1234}}));
 }
 
 // No answers. A wait takes 2000 polls.

@@ -167,23 +167,22 @@ TEST(Thread, HasItsNameStackSignalMaskAndCpu) {
     EXPECT_EQ(seen.runs, 2);
 }
 
-void *sleep_for_ever(void *) {
-    for (;;)
-        pause();
-}
 cthread *make_sleeper(uint32_t policy) {
+    const auto sleep_for_ever = [](void *) -> void * {
+        for (;;)
+            pause();
+    };
     return cthread_init("sleeper", sleep_for_ever, nullptr, nullptr, nullptr, policy, 0, 0, 0);
 }
 
-TEST(Thread, ThatDoesNotStartEndsAllTheSame) {
+TEST(Thread, AllAreCancelledBeforeTheFirstIsJoined) {
+    // A thread that was not started, or could not be, ends all the same.
     cthread *idle = make_sleeper(SCHED_OTHER), *refused = make_sleeper(77);
     cthread_cancel(idle);
     cthread_join(idle);
     EXPECT_TRUE(cthread_start(refused) == 1 && refused->listed == 0);
     cthread_join(refused);
-}
 
-TEST(Thread, AllAreCancelledBeforeTheFirstIsJoined) {
     cthread *one = nullptr;
     for (int i = 0; i < 21; i++) {
         one = make_sleeper(SCHED_OTHER);

@@ -180,7 +180,6 @@ TEST_F(Unload, RefusalsAndTheirLines) {
 TEST_F(Unload, TheFormOfAnElementFollowsFlagsAndMode) {
     // Flags and mode; form, size, and place of the weight.
     const std::tuple<uint16_t, uint32_t, int, uint32_t, uint32_t> rows[] = {
-        {0, 1, WCCP_ELEMENT_HASH, 44, 40},        {0, 2, WCCP_ELEMENT_HASH, 44, 40},
         {1, 1, WCCP_ELEMENT_HASH, 44, 40},        {0x80, 2, WCCP_ELEMENT_HASH, 44, 40},
         {3, 1, WCCP_ELEMENT_NO_REDIRECT, 32, 28}, {3, 2, WCCP_ELEMENT_NO_REDIRECT, 32, 28},
         {2, 1, WCCP_ELEMENT_REDIRECT, 16, 12},    {2, 2, WCCP_ELEMENT_REDIRECT, 32, 28}};

@@ -78,10 +78,9 @@ struct Threads : testing::Test {
         const wccp_service_group *group = wccp_find_group(id);
         return group ? group->sending_router_count : 0;
     }
-    static const cthread *start_timer_thread() {
+    static void start_timer_thread() {
         cthread *timer = cthread_init("WCCP_TIMER", wccp_timer_thread_fn, {}, nullptr, {}, 0, 0, 0, 0);
         EXPECT_EQ(cthread_start(timer), 0);
-        return timer;
     }
 
     // After a stop or an exit.
