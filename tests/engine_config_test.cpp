@@ -35,7 +35,6 @@ struct Config : testing::Test {
     void TearDown() override { tables_agree(); }
 
     static wccp_grp_config config(uint8_t id) { return engine_fixture::group_config(id, {"10.0.0.2"}); }
-    wccp_service_group *add(const wccp_grp_config &with) const { return engine.add_group(with); }
     static int modify(uint8_t id, uint32_t flags, wccp_grp_config update = {}) {
         update.group_id = id;
         update.config_flags = flags;
@@ -59,7 +58,7 @@ TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
     };
     uint8_t id = 0;
     for (const auto &[given, unicast, multicast] : cases) {
-        const wccp_service_group *group = add(engine_fixture::group_config(id++, given));
+        const wccp_service_group *group = engine.add_group(engine_fixture::group_config(id++, given));
         ASSERT_EQ(group->ucast_router_count, unicast);
         for (size_t i = 0; i < unicast; i++)
             EXPECT_EQ(group->ucast_routers[i], ipa(given[i]));
@@ -68,7 +67,7 @@ TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
     }
     wccp_grp_config full = config(id);
     full.router_count = 65535; // more than there is room for
-    EXPECT_EQ(add(full)->ucast_router_count, 32);
+    EXPECT_EQ(engine.add_group(full)->ucast_router_count, 32);
 }
 
 TEST_F(Config, ARecordIsCopiedFieldByField) {
@@ -79,7 +78,7 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
     with.mask_src_ip = 0xf0000001;
     with.mask_dst_port = 0x0003;
     with.compatibility = 3; // invalid: 1 is used
-    const wccp_service_group *group = add(with);
+    const wccp_service_group *group = engine.add_group(with);
     EXPECT_EQ((numbers{group->service_flags, group->mask_bits, group->compat_mode, group->state_flags,
                        group->hia_timer.countdown, group->hia_timer.period, group->monitor_timer.countdown}),
               (numbers{0x9, 7, 1, WCCP_STATE_INIT, 1, 10, 5}));
@@ -88,7 +87,7 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
 
     wccp_grp_config other = config(62);
     other.compatibility = WCCP_COMPAT_NEXUS;
-    const wccp_service_group *second = add(other);
+    const wccp_service_group *second = engine.add_group(other);
     EXPECT_TRUE(second->security_option == 0 && second->compat_mode == 2);
     EXPECT_EQ(wccp_g.group_list, second) << "newest first";
 
@@ -97,11 +96,11 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
     EXPECT_TRUE(wccp_find_group(61) == group && wccp_find_group(61 + 256) == group);
     memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
-    EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
+    EXPECT_STREQ(engine.add_group(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
 }
 
 TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
-    wccp_service_group *group = add(config(61));
+    wccp_service_group *group = engine.add_group(config(61));
     const std::tuple<uint32_t, bool, uint32_t> steps[] = {
         {1, false, 1}, {7, true, 2}, {2, false, 2}, {1, true, 1}};
     for (const auto &[admin, changes, state] : steps) {
@@ -112,7 +111,7 @@ TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
         engine.set_admin(99, admin); // a missing group is not a failure here
     }
     // Stopping all skips disabled groups.
-    wccp_service_group *down = add(config(2)), *unset = add(config(3));
+    wccp_service_group *down = engine.add_group(config(2)), *unset = engine.add_group(config(3));
     down->admin_state = WCCP_ADMIN_DOWN;
     unset->admin_state = 0;
     group->change_number = down->change_number = unset->change_number = 3;
@@ -136,7 +135,7 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
     fill.mask_src_ip = 0x3;
     fill.mask_dst_port = 0x1f;
     memcpy(fill.password, "secret", 6);
-    const wccp_service_group *group = add(config(61));
+    const wccp_service_group *group = engine.add_group(config(61));
     // Afterwards: weight, service flags, mask bits; and the refusal.
     const std::tuple<uint32_t, uint32_t, uint32_t, uint32_t, const char *> rows[] = {
         {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, 100, 0, 0, ""}, // of several, the first in order acts
@@ -174,7 +173,7 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
 TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
     wccp_grp_config with = config(61);
     with.mask_src_ip = 0xf;
-    wccp_service_group *group = add(with);
+    wccp_service_group *group = engine.add_group(with);
     make_active(group);
     group->designated = group->redirecting_routers = group->assign_timer.active = 1;
     group->dsg_key_change = group->pending_acks = 9;
@@ -205,7 +204,7 @@ TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
 
 TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
     for (const uint8_t id : bytes{5, 255, 7, 0, 3})
-        add(config(id));
+        engine.add_group(config(id));
     EXPECT_TRUE(wccp_del_group(7) == 0 && engine.sent_to("10.0.0.2").empty());
     tables_agree();
     wccp_grp_list list = {};
@@ -219,7 +218,7 @@ TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
 
 // What the tests of the monitoring tree cannot see of the queries.
 TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
-    wccp_service_group *group = add(config(61));
+    wccp_service_group *group = engine.add_group(config(61));
     wccp_grp_info info = {};
     for (const auto &[flags, word] : {std::pair{6u, "uknown"}, {3u, "unknown"}}) {
         group->state_flags = flags;

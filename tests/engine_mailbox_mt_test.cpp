@@ -146,7 +146,6 @@ TEST_F(Mailbox, ATunneldThatDoesNotAnswerIsTriedAgainAfterTenSeconds) {
     } steps[] = {
         {nullptr, l2_return, 2000, MAILBOX_L2_RETURN, l2_line},
         {nullptr, add, 0, MAILBOX_L2_RETURN, add_line},
-        {nullptr, l2_return, 0, MAILBOX_L2_RETURN, l2_line},
         {nullptr, remove, 2000, MAILBOX_DELETE_TUNNEL, no_line},
         {nullptr, remove, 0, MAILBOX_DELETE_TUNNEL, no_line},
         {clear_slot, add, 2000, MAILBOX_IDLE, add_line},

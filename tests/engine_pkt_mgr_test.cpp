@@ -232,21 +232,17 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
 
 // Failures while a valid packet is processed can be repeated as often as invalid packets.
 TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
-    const auto report = [](uint32_t id, uint32_t weight, std::vector<element> seen = {}) {
-        seen.push_back({100, weight, 0});
-        return make_icu(id, view(id, seen), {by_mask});
+    const auto varied = [](uint32_t i) { // with an appliance that the other router does not list
+        return make_icu(1, view(1, {{101 + i % 100, 1, 0}, {100, i % 2 + 1, 0}}), {by_mask});
     };
     for (const uint32_t id : {1u, 2u})
-        process(report(id, 100));
+        process(make_icu(id, view(id, {{100, 100, 0}}), {by_mask}));
     group->mask_bits = WCCP_MAX_MASK_BITS + 1;
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
     const std::pair<const char *, std::function<bytes(uint32_t)>> rows[] = {
-        {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }},
-        {"is not in all sending router views",
-         [&](uint32_t i) {
-             return report(1, i % 2 + 1, std::vector{element{101 + i % 100, 1, 0}});
-         }},
+        {"mask assignment: too many bits", varied},
+        {"is not in all sending router views", varied},
         {"failed to add tunnel",
          [this](uint32_t i) {
              group->ret_method = WCCP_METHOD_GRE;

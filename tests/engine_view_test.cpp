@@ -128,7 +128,6 @@ TEST_F(ViewTest, TheRoleFollowsWhatRoutersAssign) {
         {A, 100, 256, 1, ACTIVE, 1, ""},
         {B, 128, 256, 2, ACTIVE, 1, ""},
         {A, 0, 256, 1, ACTIVE, 1, ""},
-        {A, 0, 200, 1, ACTIVE, 1, ""},
         // B assigns elsewhere; then only A does; then no router.
         {B, 0, 256, 0, BACKUP, 2, "last router stopped redirecting to self. (router id 10.0.0.202)"},
         {B, 256, 256, 1, ACTIVE, 3, "first router to self (router id 10.0.0.202 )"},
