@@ -334,6 +334,12 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
         EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {ordered})), 0);
         EXPECT_EQ(made->map_in_order, in_order);
     }
+    // The largest one.
+    const size_t others = make_icu(1, mask_view(1, {100, 101}), {map_part({})}).size();
+    numbers largest((WCCP_MAX_PACKET - others) / 16, 101);
+    largest.back() = 100;
+    EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {map_part(largest)})), 0);
+    EXPECT_TRUE(made->self_buckets == 1 && made->total_buckets == largest.size() && largest.size() > 240);
     EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {map_part({101, 100})})), 0);
     EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1 && !made->map_in_order);
 

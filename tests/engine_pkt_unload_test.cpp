@@ -3,6 +3,9 @@
 
 #include "engine/wccp_pkt_unload.h"
 
+#include <bit>
+#include <random>
+
 #include "tests/support/engine_fixture.h"
 #include "tests/support/wire_bytes.h"
 
@@ -230,23 +233,23 @@ decoded_elements decode_elements(wccp_service_group *group, const std::vector<wi
 TEST_F(Unload, ElementsAreDecodedByTheirForm) {
     const wire_bytes full = wire_bytes().fill(32, 0xff);
     const std::vector<wire_bytes> elements = {
-        hash_form(1, 100, hex("80010000 ff 0123456789abcdef")), // 42 bits
+        hash_form(1, 100, hex("80010000 ff")),
         hash_form(2, 0x1234, full),
         hash_form(3, 7, full, WCCP_IDENTITY_HISTORICAL),
         element(4, 0, 3, wire_bytes().zeros(20), 44),
     };
     const decoded_elements out = decode_elements(&group, elements);
     ASSERT_EQ(out.result, 0);
-    EXPECT_TRUE(out.hash.valid == 1 && out.hash.self_count == 42);
-    EXPECT_EQ(out.hash.total_count, 256) << "298, limited";
+    EXPECT_TRUE(out.hash.valid == 1 && out.hash.self_count == 10);
+    EXPECT_EQ(out.hash.total_count, 256) << "266, limited";
     const std::tuple<uint16_t, uint16_t, uint16_t> expected[] = {
-        {100, 42, 256}, {0x1234, 256, 256}, {7, 0, 0}, {44, 0, 0}};
+        {100, 10, 256}, {0x1234, 256, 256}, {7, 0, 0}, {44, 0, 0}};
     for (uint8_t i = 0; i < 4; i++) {
         EXPECT_EQ(out.list[i].ipa, (be32{{10, 0, 0, static_cast<uint8_t>(i + 1)}}));
         EXPECT_EQ(std::tuple(out.list[i].weight, out.list[i].buckets_assigned, out.list[i].buckets_total),
                   expected[i]);
     }
-    EXPECT_TRUE(out.list[0].bucket_bits[0] == 0x80010000 && out.list[0].bucket_bits[1] == 0xff012345);
+    EXPECT_TRUE(out.list[0].bucket_bits[0] == 0x80010000 && out.list[0].bucket_bits[1] == 0xff000000);
     EXPECT_EQ(decode_elements(&group, {}).result + decode_elements(&group, {}).hash.total_count, 0);
     // Another hash revision is refused, historical or not, and so are truncated elements and null arguments.
     EXPECT_EQ(decode_elements(&group, {hash_form(1, 100, full), hash_form(2, 1, full, 0x80, 1)}).result, 1);
@@ -258,6 +261,19 @@ TEST_F(Unload, ElementsAreDecodedByTheirForm) {
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(nullptr, 0, {}, none.list, &none.hash), 1);
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(&group, 0, {}, nullptr, &none.hash), 1);
     EXPECT_EQ(wccp_process_router_view_web_cache_id_elements(&group, 0, {}, none.list, nullptr), 1);
+}
+
+TEST_F(Unload, BucketBitsAreCountedWhateverTheirPattern) {
+    std::minstd_rand random;
+    for (int round = 0; round < 500; round++) {
+        wire_bytes buckets;
+        int expected = 0;
+        for (int i = 0; i < 32; i++) {
+            buckets.u8(static_cast<uint32_t>(random()));
+            expected += std::popcount(buckets.bytes.back());
+        }
+        ASSERT_EQ(decode_elements(&group, {hash_form(1, 1, buckets)}).list[0].buckets_assigned, expected);
+    }
 }
 
 TEST_F(Unload, AMapKeepsItsFirstMaskAndItsLastValues) {
