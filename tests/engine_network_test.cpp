@@ -129,7 +129,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
     };
 
     log_lines log;
-    wccp_service_group *known = live_group();
+    live_group();
     const wccp_grp_config unicast = engine_fixture::group_config(61, {"10.0.0.2"}),
                           multicast = engine_fixture::group_config(62, {"224.0.1.62"});
     const std::pair<const char *, std::function<void()>> occasions[] = {
@@ -189,7 +189,7 @@ TEST_F(Network, AFailedSetUpIsTriedAgain) {
         }
 
     // Not when no group needs it.
-    known = wccp_find_group(61);
+    wccp_service_group *known = wccp_find_group(61);
     wan->network_flaws = WCCP_FLAW_SOCKETS;
     for (const auto &[admin, ready] : {std::pair{0u, WCCP_ALL_READY},
                                        {+WCCP_ADMIN_DOWN, WCCP_ALL_READY},
