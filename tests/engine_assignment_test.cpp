@@ -136,11 +136,10 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
             }
         }
         compute(appliances);
-        const std::string table = runs();
-        const std::vector<be32> whole(group->bucket_ipa, group->bucket_ipa + group->bucket_count);
+        const std::vector<be32> whole(group->bucket_ipa, group->bucket_ipa + 256);
         ASSERT_EQ(assigned_in_all(), group->bucket_count);
         compute(appliances);
-        ASSERT_EQ(runs(), table);
+        ASSERT_TRUE(std::equal(whole.begin(), whole.end(), group->bucket_ipa));
         compute(staying);
         ASSERT_TRUE(assigned_in_all() == group->bucket_count && group->dsg_active_count == staying.size());
         for (uint32_t slot = 0; weight != 0 && slot < group->bucket_count; slot++)

@@ -68,9 +68,7 @@ struct EngineDump : testing::Test, reported_group {
             group->ucast_routers[group->ucast_router_count++] = each;
         group->cfg_fwd_method = WCCP_METHOD_EITHER;
         group->cfg_assign_method = WCCP_ASSIGN_EITHER;
-        group->fwd_method = WCCP_METHOD_L2;
-        group->assign_method = WCCP_ASSIGN_HASH;
-        group->ret_method = WCCP_METHOD_GRE;
+        group->ret_method = WCCP_METHOD_GRE; // the others are as the router has agreed them
         group->change_number = 7;
         group->transitions = 3;
         group->designated = 1;
@@ -93,7 +91,6 @@ struct EngineDump : testing::Test, reported_group {
         first->change_number = to_be32(5);
         first->flags = WCCP_RTR_TWO_WAY | WCCP_RTR_ASSIGN_UNACKED;
         first->state_time = wccp_g.seconds - 65;
-        first->cap_fwd = 2;
         first->cap_assign = 4;
         first->cap_ret = 3;
         first->view_routers[0].flags = 1;

@@ -469,8 +469,7 @@ TEST_F(Network, AnAddressIsChangedRemovedAndAdded) {
     run_command("ip addr add 10.0.0.100/32 dev lo");
     set_address("10.0.0.7");
     const datagram shutdown_message = receive_datagram(engine.sockets["10.0.0.2"]);
-    ASSERT_GE(shutdown_message.bytes.size(), 12u);
-    EXPECT_EQ(shutdown_message.from, "10.0.0.100");
+    ASSERT_TRUE(shutdown_message.bytes.size() > 12 && shutdown_message.from == "10.0.0.100");
     EXPECT_EQ(memcmp(&shutdown_message.bytes.end()[-4], "\x0a\x00\x00\x64", 4), 0);
     EXPECT_EQ(known->appliance_ipa, ipa("10.0.0.7"));
     EXPECT_TRUE(known->state_flags == WCCP_STATE_INIT && known->hia_timer.active == 1);
@@ -483,8 +482,8 @@ TEST_F(Network, AnAddressIsChangedRemovedAndAdded) {
     set_address("");
     EXPECT_TRUE(engine.sent_to("10.0.0.2").empty() && known->tx_link_drops == 1) << "it is not tried";
     EXPECT_TRUE(is_zero(known->appliance_ipa) && known->hia_timer.active == 0);
-    EXPECT_EQ(wan->ready_flags, WCCP_LINK_READY);
-    EXPECT_EQ(wan->ucast_fd, fd) << "the sockets stay until the next address";
+    EXPECT_TRUE(wan->ready_flags == WCCP_LINK_READY && wan->ucast_fd == fd)
+        << "the sockets stay until the next address";
 
     set_address("10.0.0.9");
     wccp_tick();
