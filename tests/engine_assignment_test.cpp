@@ -16,20 +16,15 @@ using entries = std::vector<wccp_dsg_appliance>;
 wccp_dsg_appliance dsg_entry(uint32_t last_octets, uint32_t weight, bool up = true) {
     return {.ipa = host(last_octets), .up = up, .weight = static_cast<uint16_t>(weight), .assigned = 0};
 }
-// "1:100 -2:30 1.2:7": the last octets of 10.0.0.1, 10.0.0.2 and 10.0.1.2 with their weights; a minus is
-// down.
+// "1:100 -2:30 258:7": the last two octets of 10.0.0.1, 10.0.0.2 and 10.0.1.2, as numbers, with their
+// weights; a minus is down.
 entries parse_entries(const std::string &text) {
     std::istringstream words(text);
     entries found;
-    for (std::string word; words >> word;) {
-        unsigned third = 0, fourth = 0, weight = 0;
-        const char *number = word.c_str() + (word[0] == '-');
-        if (sscanf(number, "%u.%u:%u", &third, &fourth, &weight) != 3) {
-            third = 0;
-            EXPECT_EQ(sscanf(number, "%u:%u", &fourth, &weight), 2) << word;
-        }
-        found.push_back(dsg_entry(third << 8 | fourth, weight, word[0] != '-'));
-    }
+    int octets;
+    char colon;
+    for (uint32_t weight; words >> octets >> colon >> weight;)
+        found.push_back(dsg_entry(static_cast<uint32_t>(std::abs(octets)), weight, octets > 0));
     return found;
 }
 // The runs of a table, in the same form: owner and length.
@@ -38,11 +33,10 @@ std::string runs_of(const be32 *table, uint32_t slots) {
     for (uint32_t i = 0, length = 1; i < slots; i++, length++) {
         if (i + 1 < slots && table[i + 1] == table[i])
             continue;
-        const uint32_t third = table[i].bytes[2], fourth = table[i].bytes[3];
-        text << " " << (third ? std::to_string(third) + "." : "") << fourth << ":" << length;
+        text << (text.tellp() > 0 ? " " : "") << (to_host(table[i]) & 0xffff) << ":" << length;
         length = 0;
     }
-    return text.str().substr(std::min<size_t>(1, text.str().size()));
+    return text.str();
 }
 
 TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
@@ -50,11 +44,8 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         // In proportion; remainders are passed on.
         {"1:100 2:100 3:100", 256, "1:85 2:85 3:86"},
         {"1:1 2:2", 256, "1:85 2:171"},
-        {"1:10 2:20 3:30 4:40", 256, "1:25 2:51 3:77 4:103"},
         {"1:7", 256, "1:256"},
         {"1:0 2:9", 256, "2:256"},
-        {"1:3 2:3", 16, "1:8 2:8"},
-        {"1:3 2:3 3:3", 16, "1:5 2:5 3:6"},
         {"1:65535 2:1 3:65535", 256, "1:127 2:1 3:128"},
         {"1:1 2:1 3:1", 1, "3:1"},
         // Only the run of a down entry is split again. It can be too light to have slots.
@@ -64,12 +55,12 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
         {"-1:1 2:60000", 256, "2:256"},
         // Without active weights the largest word gets everything.
         {"2:0 1:0", 256, "2:256"},
-        {"9.1:0 2:0", 256, "2:256"},
+        {"2305:0 2:0", 256, "2:256"},
         {"-9:500 3:0", 256, "3:256"},
         {"-9:500 -3:0", 256, "77:256"}, // unchanged
         {"", 256, "77:256"},
         // The last octet is the most significant, and the difference wraps around.
-        {"2:1 1.1:1 1:2", 256, "1:128 1.1:64 2:64"},
+        {"2:1 257:1 1:2", 256, "1:128 257:64 2:64"},
         {"10:1 200:3", 256, "200:192 10:64"},
         {"200:3 10:1", 256, "200:192 10:64"},
         // Not transitive: 1 before 100, 100 before 200, 200 before 1. The results are those of a merge sort,
@@ -86,18 +77,15 @@ TEST(AssignmentTable, SplitsByWeightInTheOrderOfTheWords) {
     }
 }
 
-// A Fisher-Yates shuffle from the top, of values in one octet.
 TEST(AssignmentTable, ShuffleFollowsTheSeed) {
-    be32 table[256];
-    uint32_t expected[256];
-    for (uint32_t i = 0; i < 256; i++)
-        table[i] = from_raw_word(expected[i] = i);
-    scramble_u8_array(256, table, 7);
-    unsigned state = 7;
-    for (uint64_t i = 256; i-- > 0;)
-        std::swap(expected[i], expected[static_cast<uint64_t>(rand_r(&state)) * i >> 31]);
-    for (uint32_t i = 0; i < 256; i++)
-        EXPECT_EQ(raw_word(table[i]), expected[i]);
+    std::vector<be32> table;
+    for (uint32_t i = 0; i < 8; i++)
+        table.push_back(from_raw_word(i));
+    scramble_u8_array(8, table.data(), 7);
+    std::string order;
+    for (const be32 each : table)
+        order += std::to_string(raw_word(each));
+    EXPECT_EQ(order, "52641703");
 }
 
 // A group outside the engine's tables.
@@ -129,10 +117,8 @@ struct AssignmentTest : testing::Test {
 // With any weights, each slot has an active owner, the same input gives the same table, and when appliances
 // leave, the slots of the others do not move.
 TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
-    uint32_t state = 20011;
-    const auto random = [&state](uint32_t below) {
-        state = state * 1664525 + 1013904223;
-        return (state >> 8) % below;
+    auto random = [state = 20011u](uint32_t below) mutable {
+        return static_cast<uint32_t>(rand_r(&state)) % below;
     };
     for (int round = 0; round < 2000; round++) {
         *group = {};
@@ -142,9 +128,8 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         entries appliances, staying;
         uint32_t weight = 0;
         for (uint32_t i = 0, count = 1 + random(32); i < count; i++) {
-            const uint32_t weights[] = {0, 65535, random(65536)};
-            appliances.push_back(
-                dsg_entry(random(256) << 8 | (i * 8 + random(8)), weights[std::min(random(4), 2u)]));
+            const uint32_t weights[] = {0, 65535, random(65536), random(65536)};
+            appliances.push_back(dsg_entry(random(256) << 8 | (i * 8 + random(8)), weights[random(4)]));
             if (i == 0 || random(3)) {
                 staying.push_back(appliances.back());
                 weight += appliances.back().weight;
@@ -154,13 +139,11 @@ TEST_F(AssignmentTest, AnyWeightsFillTheTable) {
         const std::vector<be32> whole(group->bucket_ipa, group->bucket_ipa + 256);
         ASSERT_EQ(assigned_in_all(), group->bucket_count);
         compute(appliances);
-        ASSERT_EQ(memcmp(whole.data(), group->bucket_ipa, sizeof group->bucket_ipa), 0);
+        ASSERT_TRUE(std::equal(whole.begin(), whole.end(), group->bucket_ipa));
         compute(staying);
         ASSERT_TRUE(assigned_in_all() == group->bucket_count && group->dsg_active_count == staying.size());
         for (uint32_t slot = 0; weight != 0 && slot < group->bucket_count; slot++)
-            if (is_active(whole[slot])) {
-                ASSERT_EQ(group->bucket_ipa[slot], whole[slot]);
-            }
+            ASSERT_TRUE(!is_active(whole[slot]) || group->bucket_ipa[slot] == whole[slot]);
     }
 }
 
@@ -266,14 +249,9 @@ TEST_F(MaskTest, ValuesCountUpFromTheDestinationPortsLowestBit) {
     const list high = {{0, 0, 0, 0},   {0, 0, 0x8000, 0},   {0, 16, 0, 0},   {0, 16, 0x8000, 0},
                        {top, 0, 0, 0}, {top, 0, 0x8000, 0}, {top, 16, 0, 0}, {top, 16, 0x8000, 0}};
     EXPECT_EQ(values_of({top, 16, 0x8000, 0}), high);
-    EXPECT_EQ(values_of({}), (list{{0, 0, 0, 0}}));
-}
-
-TEST_F(MaskTest, SevenBitsAreUsedAndEightReplaced) {
+    // Seven bits are used, eight are replaced.
     const list seven = values_of({0, 0x1741, 0, 1});
-    EXPECT_EQ(seven.size(), 128u);
-    EXPECT_EQ(seven.back(), (value{0, 0x1741, 0, 1}));
-
+    EXPECT_TRUE(seven.size() == 128 && seven.back() == (value{0, 0x1741, 0, 1}));
     const list eight = values_of({0, 0x1741, 2, 1});
     EXPECT_EQ((value{group->mask_bits, group->mask_value_bits, group->mask_src_port, group->mask_dst_ip}),
               (value{8, 4, 2, 0x1741}));
@@ -295,7 +273,8 @@ TEST_F(MaskTest, ValuesAreSharedLikeBuckets) {
     EXPECT_EQ(wccp_mask_assignment_assign_mask_values(group.get()), 1);
     EXPECT_EQ(group->dsg_appliances[0].assigned, 6);
 
-    values_of({}); // one value, which the last appliance in order gets
+    // One value, which the last appliance in order gets.
+    EXPECT_EQ(values_of({}), (list{{0, 0, 0, 0}}));
     compute(parse_entries("1:100 2:100"));
     EXPECT_EQ(runs(), "2:1");
     EXPECT_EQ(group->mask_values[0].appliance_ipa, host(2));

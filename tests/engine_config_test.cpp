@@ -3,7 +3,10 @@
 
 #include "engine/wccp_query.h"
 
-#include "runtime/list.h"
+#include <set>
+
+#include "engine/wccp_router_utils.h"
+#include "engine/wccp_view_utils.h"
 #include "tests/support/engine_fixture.h"
 
 namespace {
@@ -11,46 +14,36 @@ namespace {
 using bytes = std::vector<uint8_t>;
 using numbers = std::vector<uint32_t>;
 
+// All three tables have the same groups, with the right links.
 void tables_agree() {
-    uint32_t slots = 0, listed = 0, on_interfaces = 0;
+    std::multiset<const wccp_service_group *> slots, listed, on_interfaces;
     for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++)
-        if (wccp_g.groups[id]) {
-            slots++;
-            EXPECT_EQ(wccp_g.groups[id]->id, id);
-        }
-    for (wccp_service_group **link = &wccp_g.group_list; *link; link = &(*link)->next) {
-        listed++;
-        EXPECT_TRUE((*link)->prev_link == link && wccp_g.groups[(*link)->id] == *link);
-    }
-    for (uint32_t i = 0; i < wccp_g.if_count; i++)
-        for (wccp_service_group **link = &wccp_g.interfaces[i].groups; *link; link = &(*link)->if_next) {
-            on_interfaces++;
-            EXPECT_TRUE((*link)->if_prev_link == link && (*link)->interfaces[0] == &wccp_g.interfaces[i]);
-        }
-    EXPECT_TRUE(slots == wccp_g.group_count && listed == slots && on_interfaces == slots);
+        if (wccp_g.groups[id] && wccp_g.groups[id]->id == id)
+            slots.insert(wccp_g.groups[id]);
+    for (wccp_service_group **link = &wccp_g.group_list; *link; link = &(*link)->next)
+        if ((*link)->prev_link == link)
+            listed.insert(*link);
+    for (wccp_interface &each : wccp_g.interfaces)
+        for (wccp_service_group **link = &each.groups; *link; link = &(*link)->if_next)
+            if ((*link)->if_prev_link == link && (*link)->interfaces[0] == &each)
+                on_interfaces.insert(*link);
+    EXPECT_TRUE(slots.size() == wccp_g.group_count && listed == slots && on_interfaces == slots);
 }
 
 struct Config : testing::Test {
     void SetUp() override { engine.router_socket("10.0.0.2"); }
     void TearDown() override { tables_agree(); }
 
-    static wccp_grp_config config(uint8_t id, const char *interface = "wan0") {
-        wccp_grp_config out = engine_fixture::group_config(id, {"10.0.0.2"});
-        strlcpy(out.interface, interface, sizeof out.interface);
-        return out;
-    }
-    wccp_service_group *add(const wccp_grp_config &with) const { return engine.add_group(with); }
+    static wccp_grp_config config(uint8_t id) { return engine_fixture::group_config(id, {"10.0.0.2"}); }
     static int modify(uint8_t id, uint32_t flags, wccp_grp_config update = {}) {
         update.group_id = id;
         update.config_flags = flags;
         return wccp_modify_grp(&update);
     }
-    static wccp_sending_router *add_router(wccp_service_group *group, const std::string &id) {
-        auto *record = static_cast<wccp_sending_router *>(wccp_calloc(1, sizeof(wccp_sending_router)));
-        record->router_id = ipa(id);
-        list_push_head(&group->sending_routers, record);
-        group->sending_router_count++;
-        return record;
+    // By L2 and hash.
+    static wccp_sending_router *add_router(wccp_service_group *group) {
+        const wccp_rtr_capabilities offered = {WCCP_METHOD_L2, WCCP_ASSIGN_HASH, WCCP_METHOD_L2};
+        return wccp_create_sending_router(group, ipa("10.0.0.2"), &offered, &offered);
     }
     engine_fixture engine;
 };
@@ -65,28 +58,27 @@ TEST_F(Config, TheFirstMulticastAddressEndsTheRouterList) {
     };
     uint8_t id = 0;
     for (const auto &[given, unicast, multicast] : cases) {
-        const wccp_service_group *group = add(engine_fixture::group_config(id++, given));
+        const wccp_service_group *group = engine.add_group(engine_fixture::group_config(id++, given));
         ASSERT_EQ(group->ucast_router_count, unicast);
         for (size_t i = 0; i < unicast; i++)
             EXPECT_EQ(group->ucast_routers[i], ipa(given[i]));
-        EXPECT_EQ(group->mcast_ipa, ipa(multicast));
-        EXPECT_EQ(group->mcast_configured, !is_zero(group->mcast_ipa));
+        EXPECT_EQ(std::pair(group->mcast_ipa, group->mcast_configured != 0),
+                  std::pair(ipa(multicast), multicast != std::string("0.0.0.0")));
     }
     wccp_grp_config full = config(id);
     full.router_count = 65535; // more than there is room for
-    EXPECT_EQ(add(full)->ucast_router_count, 32);
+    EXPECT_EQ(engine.add_group(full)->ucast_router_count, 32);
 }
 
 TEST_F(Config, ARecordIsCopiedFieldByField) {
     wccp_grp_config with = config(61);
     memcpy(with.password, "12345678", 8);
-    with.hash_src_ip = 1;
+    with.hash_src_ip = with.hash_dst_port = 1;
     with.hash_dst_ip = 2; // only 1 counts
-    with.hash_dst_port = 1;
     with.mask_src_ip = 0xf0000001;
     with.mask_dst_port = 0x0003;
     with.compatibility = 3; // invalid: 1 is used
-    const wccp_service_group *group = add(with);
+    const wccp_service_group *group = engine.add_group(with);
     EXPECT_EQ((numbers{group->service_flags, group->mask_bits, group->compat_mode, group->state_flags,
                        group->hia_timer.countdown, group->hia_timer.period, group->monitor_timer.countdown}),
               (numbers{0x9, 7, 1, WCCP_STATE_INIT, 1, 10, 5}));
@@ -95,7 +87,7 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
 
     wccp_grp_config other = config(62);
     other.compatibility = WCCP_COMPAT_NEXUS;
-    const wccp_service_group *second = add(other);
+    const wccp_service_group *second = engine.add_group(other);
     EXPECT_TRUE(second->security_option == 0 && second->compat_mode == 2);
     EXPECT_EQ(wccp_g.group_list, second) << "newest first";
 
@@ -104,38 +96,34 @@ TEST_F(Config, ARecordIsCopiedFieldByField) {
     EXPECT_TRUE(wccp_find_group(61) == group && wccp_find_group(61 + 256) == group);
     memset(other.interface, 'x', sizeof other.interface); // not terminated
     other.group_id = 63;
-    EXPECT_STREQ(add(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
-}
-
-TEST_F(Config, AGroupStartsAsFarAsItCan) {
-    // Enabled, on an interface that is not ready: only the connectivity alarm runs.
-    const wccp_service_group *waiting = add(config(10, "absent0"));
-    EXPECT_EQ(std::tuple(waiting->hia_timer.active, waiting->monitor_timer.active,
-                         waiting->router_alarm_timer.active),
-              std::tuple(0, 0, 1));
-    // Disabled, or not configured: no timer runs.
-    for (const uint32_t admin : {WCCP_ADMIN_DOWN + 0u, 0u}) {
-        wccp_grp_config with = config(static_cast<uint8_t>(11 + admin));
-        with.admin = admin;
-        const wccp_service_group *group = add(with);
-        EXPECT_EQ(group->state_flags, WCCP_STATE_INIT);
-        EXPECT_EQ(group->hia_timer.active + group->router_alarm_timer.active, 0);
-    }
+    EXPECT_STREQ(engine.add_group(other)->interfaces[0]->name, "xxxxxxxxxxxxxxx");
 }
 
 TEST_F(Config, DisablingStopsOnceAndEnablingStartsOnce) {
-    wccp_service_group *group = add(config(61));
+    wccp_service_group *group = engine.add_group(config(61));
     const std::tuple<uint32_t, bool, uint32_t> steps[] = {
         {1, false, 1}, {7, true, 2}, {2, false, 2}, {1, true, 1}};
     for (const auto &[admin, changes, state] : steps) {
-        wccp_grp_config update = {};
-        update.admin = admin;
         group->change_number = 5;
-        EXPECT_EQ(modify(61, WCCP_CFG_ADMIN, update), 0);
+        engine.set_admin(61, admin);
         EXPECT_EQ(std::tuple(group->admin_state, group->change_number, group->hia_timer.active),
                   std::tuple(state, changes ? 0 : 5, state == 1));
-        EXPECT_EQ(modify(99, WCCP_CFG_ADMIN, update), 0) << "a missing group is not a failure here";
+        engine.set_admin(99, admin); // a missing group is not a failure here
     }
+    // Stopping all skips disabled groups.
+    wccp_service_group *down = engine.add_group(config(2)), *unset = engine.add_group(config(3));
+    down->admin_state = WCCP_ADMIN_DOWN;
+    unset->admin_state = 0;
+    group->change_number = down->change_number = unset->change_number = 3;
+    EXPECT_EQ(wccp_stop_all_service_groups(), 0);
+    engine.set_admin(3, 0); // disabled once more
+    EXPECT_EQ((numbers{group->change_number, down->change_number, unset->change_number, group->admin_state,
+                       unset->admin_state}),
+              (numbers{0, 3, 3, WCCP_ADMIN_UP, 0}));
+    // Without an address nothing starts.
+    engine.interface->ready_flags = WCCP_LINK_READY;
+    wccp_start_service_groups_by_interface(engine.interface);
+    EXPECT_EQ(group->hia_timer.active, 0);
 }
 
 // tests/daemon_config_test.cpp has the update of each field.
@@ -147,7 +135,7 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
     fill.mask_src_ip = 0x3;
     fill.mask_dst_port = 0x1f;
     memcpy(fill.password, "secret", 6);
-    const wccp_service_group *group = add(config(61));
+    const wccp_service_group *group = engine.add_group(config(61));
     // Afterwards: weight, service flags, mask bits; and the refusal.
     const std::tuple<uint32_t, uint32_t, uint32_t, uint32_t, const char *> rows[] = {
         {WCCP_CFG_ADMIN | WCCP_CFG_WEIGHT, 100, 0, 0, ""}, // of several, the first in order acts
@@ -185,88 +173,60 @@ TEST_F(Config, AnUpdateActsOnOneFlagOrIsRefused) {
 TEST_F(Config, AStopSendsAShutdownMessageAndKeepsTheConfiguration) {
     wccp_grp_config with = config(61);
     with.mask_src_ip = 0xf;
-    wccp_service_group *group = add(with);
+    wccp_service_group *group = engine.add_group(with);
     make_active(group);
-    group->fwd_method = group->assign_method = group->ret_method = 1;
-    group->state_flags |= WCCP_CAPABILITIES_SET;
     group->designated = group->redirecting_routers = group->assign_timer.active = 1;
-    group->change_number = group->dsg_key_change = group->pending_acks = 9;
+    group->dsg_key_change = group->pending_acks = 9;
     group->dsg_appliances[31].weight = 5;
     group->rx_icus = 12;
+    const wccp_rtr_view_appliance seen = {ipa("10.0.0.100"), 100, 0, 0, 0, {}};
+    wccp_update_appliance_view(group, add_router(group), 1, &seen);
     group->router_alarm_timer.countdown = 7;
-    add_router(group, "10.0.0.2")->flags = WCCP_RTR_TWO_WAY;
-    auto *appliance = static_cast<wccp_view_appliance *>(wccp_calloc(1, sizeof(wccp_view_appliance)));
-    list_push_head(&group->appliance_view, appliance);
-    group->appliance_view_count++;
 
     wccp_stop_service_group(group);
     const bytes shutdown = engine.sent_to("10.0.0.2");
     ASSERT_GE(shutdown.size(), 20u);
     EXPECT_EQ(shutdown[3], 10) << "a Here-I-Am";
     EXPECT_EQ(bytes(shutdown.end() - 12, shutdown.end()), (bytes{0, 15, 0, 8, 0, 1, 0, 4, 10, 0, 0, 100}));
-    EXPECT_EQ(group->hia_timer.active + group->assign_timer.active + group->monitor_timer.active, 0);
-    EXPECT_EQ((numbers{group->state_flags, group->fwd_method, group->assign_method, group->ret_method,
-                       group->designated, group->change_number, group->dsg_key_change, group->pending_acks,
-                       group->redirecting_routers, group->dsg_appliances[31].weight,
-                       group->sending_router_count, group->appliance_view_count}),
-              (numbers{WCCP_STATE_INIT, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0}));
-    EXPECT_TRUE(group->rx_icus == 12 && group->weight == 100 && group->mask_bits == 4);
-    EXPECT_TRUE(group->router_alarm_timer.active == 1 && group->router_alarm_timer.countdown == 60);
-
+    EXPECT_EQ(
+        (numbers{group->hia_timer.active, group->assign_timer.active, group->monitor_timer.active,
+                 group->fwd_method, group->assign_method, group->ret_method, group->designated,
+                 group->change_number, group->dsg_key_change, group->pending_acks, group->redirecting_routers,
+                 group->dsg_appliances[31].weight, group->sending_router_count, group->appliance_view_count}),
+        numbers(14, 0));
+    EXPECT_EQ((numbers{group->state_flags, group->rx_icus, group->weight, group->mask_bits,
+                       group->router_alarm_timer.active, group->router_alarm_timer.countdown}),
+              (numbers{WCCP_STATE_INIT, 12, 100, 4, 1, 60}));
     wccp_stop_service_group(group);
     EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{}) << "nothing to withdraw a second time";
     EXPECT_EQ(group->tx_here_i_am, 1u);
 }
 
 TEST_F(Config, ADeletedGroupSendsAShutdownMessageUnlessItIsInInit) {
-    for (uint32_t id = 0; id < WCCP_MAX_GROUPS; id++)
-        add(config(static_cast<uint8_t>(id)));
+    for (const uint8_t id : bytes{5, 255, 7, 0, 3})
+        engine.add_group(config(id));
+    EXPECT_TRUE(wccp_del_group(7) == 0 && engine.sent_to("10.0.0.2").empty());
     tables_agree();
-    for (int id = 1; id < 256; id++)
-        EXPECT_TRUE(id == 3 || id == 5 || id == 255 || wccp_del_group(id) == 0);
-    tables_agree();
-    EXPECT_EQ(engine.sent_to("10.0.0.2"), bytes{});
     wccp_grp_list list = {};
     EXPECT_TRUE(wccp_get_grp_list(&list) == 0 && list.count == 4 && list.ids[3] == 255);
     for (wccp_service_group *group = wccp_g.group_list; group; group = group->next)
         make_active(group);
     EXPECT_TRUE(wccp_del_group(3 + 256) == 0 && wccp_del_all_groups() == 0);
-    for (const uint8_t id : {uint8_t{3}, uint8_t{0}, uint8_t{5}, uint8_t{255}})
+    for (const uint8_t id : bytes{3, 0, 5, 255})
         EXPECT_EQ(engine.sent_to("10.0.0.2").at(8 + 8 + 5), id) << "in ascending order of ids";
-}
-
-// engine_network_test has the groups that follow their interface.
-TEST_F(Config, StoppingAllSkipsDisabledGroups) {
-    wccp_service_group *up = add(config(1)), *down = add(config(2)), *unset = add(config(3));
-    down->admin_state = WCCP_ADMIN_DOWN;
-    unset->admin_state = 0;
-    up->change_number = down->change_number = unset->change_number = 3;
-    EXPECT_EQ(wccp_stop_all_service_groups(), 0);
-    EXPECT_TRUE(up->change_number == 0 && up->admin_state == WCCP_ADMIN_UP);
-    engine.interface->ready_flags = WCCP_LINK_READY;
-    wccp_start_service_groups_by_interface(engine.interface);
-    EXPECT_EQ(up->hia_timer.active, 0);
-    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN), 0); // disabled once more
-    EXPECT_EQ((numbers{unset->admin_state, down->change_number, unset->change_number}), (numbers{0, 3, 3}));
-    engine.interface->ready_flags = WCCP_ALL_READY;
-    wccp_grp_config enabled = {};
-    enabled.admin = WCCP_ADMIN_UP;
-    EXPECT_EQ(modify(3, WCCP_CFG_ADMIN, enabled), 0);
-    EXPECT_TRUE(unset->admin_state == WCCP_ADMIN_UP && unset->hia_timer.active == 1);
 }
 
 // What the tests of the monitoring tree cannot see of the queries.
 TEST_F(Config, QueriesForUnknownValuesAndAbsentRecords) {
-    wccp_service_group *group = add(config(61));
+    wccp_service_group *group = engine.add_group(config(61));
     wccp_grp_info info = {};
     for (const auto &[flags, word] : {std::pair{6u, "uknown"}, {3u, "unknown"}}) {
         group->state_flags = flags;
         EXPECT_EQ(wccp_get_grp_info(61, &info), 0);
         EXPECT_STREQ(info.oper, word);
     }
-    group->state_flags = WCCP_STATE_INIT | WCCP_CAPABILITIES_SET;
+    add_router(group);
     group->assign_method = 9;
-    add_router(group, "10.0.0.8");
     wccp_grp_router_info router = {};
     router.router_num = 1;
     EXPECT_EQ(wccp_get_grp_router_info(61, &router), 0);

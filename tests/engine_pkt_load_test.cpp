@@ -12,8 +12,9 @@
 namespace {
 
 using bytes = std::vector<uint8_t>;
+using builder = int (*)(wccp_service_group *, wccp_pkt *);
 
-// A group outside the engine's tables, and a zeroed packet.
+// A group outside the engine's tables, and a packet.
 struct Load : testing::Test {
     void SetUp() override {
         group->id = 50;
@@ -23,11 +24,13 @@ struct Load : testing::Test {
         group->appliance_ipa = host(100);
         group->weight = 0x0102;
         group->change_number = 0x01020304;
-        clear();
     }
-    void clear() {
-        memset(static_cast<void *>(pkt.get()), 0, sizeof *pkt);
+    // Into a zeroed packet that has `used` bytes already.
+    int build(builder loads, uint32_t used = 0) {
+        *pkt = {};
         pkt->cursor = pkt->data;
+        pkt->length = pkt->offset = used;
+        return loads(group.get(), pkt.get());
     }
     void add_routers(uint32_t count) {
         for (uint32_t i = 0; i < count; i++) {
@@ -63,20 +66,18 @@ struct Load : testing::Test {
     std::unique_ptr<wccp_view_appliance[]> appliances{new wccp_view_appliance[2048]{}};
 };
 
-const wire_bytes no_security = hex("0000 0004 00000000"), standard_service = hex("0001 0018 00 32 00*22"),
+const wire_bytes no_security = hex("0000 0004 00000000"),
                  dynamic_service = hex("0001 0018 01 33 c8 06 00000013 00*16");
-
-TEST_F(Load, TheFirstHereIAmOfAStandardGroup) {
-    const wire_bytes identity = hex("0003 002c 0a000064 0000 0000 00*32 0102 0000");
-    const wire_bytes view = hex("0005 000c 01020304 00000000 00000000");
-    ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
-    EXPECT_EQ(loaded(), wire_message(10, {no_security, standard_service, identity, view}));
-    EXPECT_TRUE(pkt->length == 108 && pkt->offset == 108 && pkt->cursor == pkt->data + 108);
-}
 
 // Every component of a Here-I-Am. The digest was computed by md5sum over the 8 bytes of the password and this
 // message with 16 zero bytes in its place.
 TEST_F(Load, AFullHereIAmWithItsDigest) {
+    ASSERT_EQ(build(wccp_pkt_build_here_i_am), 0); // the first one, of a standard group
+    EXPECT_EQ(loaded(), wire_message(10, {no_security, hex("0001 0018 00 32 00*22"),
+                                          hex("0003 002c 0a000064 0000 0000 00*32 0102 0000"),
+                                          hex("0005 000c 01020304 00000000 00000000")}));
+    EXPECT_TRUE(pkt->length == 108 && pkt->offset == 108 && pkt->cursor == pkt->data + 108);
+
     group->id = 90;
     group->security_option = 1;
     memcpy(group->password, "pass", 4);
@@ -98,13 +99,12 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
                                 "00000003 0a000066 0a000065 0a000064");
     const wire_bytes capabilities = hex("0008 0018 0001 0004 00000002 0002 0004 00000002 0003 0004 00000002");
     const wire_bytes command = hex("000f 0008 0001 0004 0a000064");
-    ASSERT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+    ASSERT_EQ(build(wccp_pkt_build_here_i_am), 0);
     EXPECT_EQ(loaded(), wire_message(10, {security, service, identity, view, capabilities, command}));
 
     // The digest covers all 8 bytes of the password and the whole message.
     const auto digest = [this] {
-        clear();
-        EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 0);
+        EXPECT_EQ(build(wccp_pkt_build_here_i_am), 0);
         return bytes(pkt->data + 16, pkt->data + 32);
     };
     memcpy(group->password, "password", 8);
@@ -116,8 +116,7 @@ TEST_F(Load, AFullHereIAmWithItsDigest) {
 
 TEST_F(Load, CapabilitiesListWhatDiffersFromTheDefaults) {
     const std::tuple<uint32_t, uint32_t, uint32_t, const char *> rows[] = {
-        {0, 0, 0, ""},
-        {1, 1, 1, ""},
+        {0, 1, 1, ""},
         {2, 1, 1, "0008 0008 0001 0004 00000002"},
         {1, 2, 0, "0008 0008 0002 0004 00000002"},
         {1, 1, 2, "0008 0008 0003 0004 00000002"},
@@ -125,11 +124,10 @@ TEST_F(Load, CapabilitiesListWhatDiffersFromTheDefaults) {
     };
     log_lines log;
     for (const auto &[fwd, assign, ret, expected] : rows) {
-        clear();
         group->fwd_method = fwd;
         group->assign_method = assign;
         group->ret_method = ret;
-        EXPECT_EQ(wccp_pkt_load_capability_info_component(group.get(), pkt.get()), 0);
+        EXPECT_EQ(build(wccp_pkt_load_capability_info_component), 0);
         EXPECT_EQ(loaded(), hex(expected).bytes);
         EXPECT_EQ(log.say("WCCP: GRP 50 loading capability comp. all capabilities are default."), !*expected);
     }
@@ -147,10 +145,9 @@ TEST_F(Load, ARedirectAssignByHash) {
                                 "00000003 0a000064 0a000065 0a000066");
     for (uint32_t i = 0; i < 256; i++)
         assignment.u8(i % 3);
-    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    ASSERT_EQ(build(wccp_pkt_build_redirect_assign), 0);
     EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
-    clear();
-    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    ASSERT_EQ(build(wccp_pkt_build_redirect_assign), 0);
     EXPECT_EQ(std::tuple(routers[0].assign_tx_count, routers[1].assign_tx_count, routers[2].assign_tx_count),
               std::tuple(2, 2, 0));
 }
@@ -171,22 +168,30 @@ TEST_F(Load, ARedirectAssignByMask) {
                                       "00000001 01020304 00000f00 0506 0708 "
                                       "00000002 00000000 00000100 0000 0700 0a000065 "
                                       "01000000 00000000 0506 0000 0a000064");
-    ASSERT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+    ASSERT_EQ(build(wccp_pkt_build_redirect_assign), 0);
     EXPECT_EQ(loaded(), wire_message(12, {no_security, dynamic_service, assignment}));
     EXPECT_EQ(routers[0].assign_tx_count, 1u);
 }
 
 TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
     add_routers(1);
+    // The refusals by hash and by mask, after the state's designated appliance.
     const struct {
         uint32_t designated, routers, active, values, appliances;
-        int by_hash, by_mask;
+        std::string by_hash, by_mask;
     } rows[] = {
-        {1, 1, 1, 1, 1, 0, 0},    {0, 1, 1, 1, 1, 1, 1}, {1, 0, 1, 1, 1, 1, 1}, {1, 1, 0, 0, 1, 1, 1},
-        {1, 1, 33, 129, 1, 1, 1}, {1, 1, 1, 1, 0, 0, 1}, // only the mask form needs the view
+        {1, 1, 1, 1, 1, "", ""},
+        {0, 1, 1, 1, 1, "0 # routers 1 # active appliances 1", "0 # routers 1 appliances 1 values: 1"},
+        {1, 0, 1, 1, 1, "1 # routers 0 # active appliances 1", "1 # routers 0 appliances 1 values: 1"},
+        {1, 1, 0, 0, 1, "1 # routers 1 # active appliances 0", "1 # routers 1 appliances 1 values: 0"},
+        {1, 1, 33, 129, 1, "1 # routers 1 # active appliances 33", "1 # routers 1 appliances 1 values: 129"},
+        {1, 1, 1, 1, 0, "", "1 # routers 1 appliances 0 values: 1"}, // only the mask form needs the view
     };
+    const std::string names[] = {"", "TX HASH redirect assign: ", "TX MASK redirect assign: ", ""},
+                      neither = "WCCP: redirect assign: groups actual assignment method is not set. failed.",
+                      state = "invalid designated appliance state. designated ",
+                      unassigned = "not all buckets are assigned. assigned: 4 total: 7\n";
     log_lines log;
-    const auto text = [](uint32_t number) { return std::to_string(number); };
     group->bucket_count = 7;
     group->dsg_appliances[0].assigned = 4;
     for (const auto &row : rows) {
@@ -195,38 +200,24 @@ TEST_F(Load, AnAssignmentNeedsADesignatedApplianceWithRoutersAndSlots) {
         group->dsg_active_count = row.active;
         group->mask_value_count = row.values;
         group->appliance_view_count = row.appliances;
-        const std::string state = "invalid designated appliance state. designated " + text(row.designated) +
-                                  " # routers " + text(row.routers);
-        const std::string neither =
-                              "WCCP: redirect assign: groups actual assignment method is not set. failed.",
-                          unassigned =
-                              " redirect assign: not all buckets are assigned. assigned: 4 total: 7\n";
-        const std::tuple<int, std::string> expected[] = {
-            {1, neither},
-            {row.by_hash, row.by_hash ? "WCCP GRP 50: redirect assignment load: " + state +
-                                            " # active appliances " + text(row.active) + "\n"
-                                      : "WCCP GRP 50: TX HASH" + unassigned},
-            {row.by_mask, row.by_mask ? "WCCP GRP 50: TX MASK redirect assign: " + state + " appliances " +
-                                            text(row.appliances) + " values: " + text(row.values) + "\n"
-                                      : "WCCP GRP 50: TX MASK" + unassigned},
-            {1, neither}};
+        const std::string refusals[] = {
+            neither, row.by_hash.empty() ? "" : "redirect assignment load: " + state + row.by_hash + "\n",
+            row.by_mask.empty() ? "" : names[2] + state + row.by_mask + "\n", neither};
         for (uint32_t method = 0; method < 4; method++) {
-            const auto &[result, line] = expected[method];
-            clear();
+            const std::string &refusal = refusals[method];
             group->assign_method = method;
             const uint32_t sent = routers[0].assign_tx_count;
-            EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), result);
-            EXPECT_EQ(routers[0].assign_tx_count, sent + (result ? 0 : 1));
-            EXPECT_EQ(pkt->length == 44, result == 1) << "up to the failing component";
-            EXPECT_TRUE(log.say(line)) << line;
+            EXPECT_EQ(build(wccp_pkt_build_redirect_assign), refusal.empty() ? 0 : 1);
+            EXPECT_EQ(routers[0].assign_tx_count, sent + (refusal.empty() ? 1 : 0));
+            EXPECT_EQ(pkt->length == 44, !refusal.empty()) << "up to the failing component";
+            EXPECT_TRUE(log.say(refusal.empty() ? names[method] + unassigned : refusal)) << refusal;
         }
     }
     group->bucket_count = 4; // all slots are assigned
+    group->appliance_view_count = 1;
     for (const uint32_t method : {1u, 2u}) {
-        clear();
         group->assign_method = method;
-        group->appliance_view_count = 1;
-        EXPECT_EQ(wccp_pkt_build_redirect_assign(group.get(), pkt.get()), 0);
+        EXPECT_EQ(build(wccp_pkt_build_redirect_assign), 0);
         EXPECT_EQ(log.take(), "");
     }
 }
@@ -241,13 +232,13 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
     add_appliances(32);
     designate(32);
     group->mask_value_count = 128;
-    const std::tuple<int (*)(wccp_service_group *, wccp_pkt *), uint32_t, std::vector<uint32_t>> rows[] = {
+    const std::tuple<builder, uint32_t, std::vector<uint32_t>> rows[] = {
         {wccp_pkt_build_here_i_am, 2, {8, 24, 28, 36, 16 + 8 * 32 + 4 * 32, 28, 12}},
         {wccp_pkt_build_here_i_am, 1, {8, 24, 28, 48, 16 + 8 * 32 + 4 * 32, 20, 12}},
         {wccp_pkt_build_redirect_assign, 1, {8, 24, 28, 276 + 12 * 32 + 4 * 32}},
         {wccp_pkt_build_redirect_assign, 2, {8, 24, 28, 40 + 12 * 32 + 16 * 128}},
     };
-    for (const auto &[build, assign_method, sizes] : rows) {
+    for (const auto &[message, assign_method, sizes] : rows) {
         group->assign_method = assign_method;
         std::vector<uint32_t> starts = {0};
         uint32_t sum = 0;
@@ -257,13 +248,11 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
         }
         log_lines log;
         for (const uint32_t start : starts) {
-            clear();
-            pkt->length = pkt->offset = start;
             uint32_t end = start;
             size_t fitting = 0;
             while (fitting < sizes.size() && end + sizes[fitting] <= 4096)
                 end += sizes[fitting++];
-            EXPECT_EQ(build(group.get(), pkt.get()), fitting == sizes.size() ? 0 : 1) << start;
+            EXPECT_EQ(build(message, start), fitting == sizes.size() ? 0 : 1) << start;
             EXPECT_TRUE(pkt->length == end && pkt->offset == end) << start;
             EXPECT_EQ(std::count(pkt->data + end, pkt->data + 4096, 0), 4096 - end) << start;
             EXPECT_EQ(log.say("TX MASK redirect assign: component: (len 2472) does not fit in the pkt."),
@@ -275,20 +264,17 @@ TEST_F(Load, AComponentFitsWholeOrNotAtAll) {
 TEST_F(Load, AViewThatIsTooLargeOrMiscountedIsRefused) {
     add_routers(32);
     add_appliances(955); // 16 + 256 + 3820 bytes, at offset 4
-    pkt->length = pkt->offset = 4;
-    EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 0);
+    EXPECT_EQ(build(wccp_pkt_load_web_cache_view_info_component, 4), 0);
     EXPECT_EQ(pkt->length, 4096u);
-    clear();
-    EXPECT_EQ(wccp_pkt_build_here_i_am(group.get(), pkt.get()), 1);
+    EXPECT_EQ(build(wccp_pkt_build_here_i_am), 1);
     log_lines log;
     const std::pair<uint32_t *, const char *> lists[] = {
         {&group->sending_router_count, "WCCP router count (31) mismatch with entries in router view list"},
         {&group->appliance_view_count, "web cache count (954) mismatch with entries in appliance view list"},
     };
     for (const auto &[count, line] : lists) {
-        clear();
         --*count;
-        EXPECT_EQ(wccp_pkt_load_web_cache_view_info_component(group.get(), pkt.get()), 1);
+        EXPECT_EQ(build(wccp_pkt_load_web_cache_view_info_component), 1);
         EXPECT_TRUE(pkt->length == 0 && log.say(line));
         ++*count;
     }

@@ -14,11 +14,6 @@ namespace {
 using bytes = std::vector<uint8_t>;
 using numbers = std::vector<uint32_t>;
 
-be32 make_ipa(uint8_t third, uint8_t fourth) {
-    return {{10, 0, third, fourth}};
-}
-const be32 SENDER = make_ipa(0, 1);
-
 const wire_bytes security = security_info();
 wire_bytes service_part(uint32_t id = 51, uint32_t priority = 200, uint32_t protocol = 6,
                         uint32_t flags = 0x13) {
@@ -76,10 +71,10 @@ struct Messages : testing::Test {
         group->protocol = 6;
         group->service_flags = 0x13;
     }
-    static int process(const bytes &message, be32 from = SENDER) {
+    static int process(const bytes &message, be32 from = host(1)) {
         return wccp_process_received_packet(make_received(message, from).get());
     }
-    wccp_sending_router *router(uint8_t id) const { return wccp_find_sending_router(group, make_ipa(0, id)); }
+    wccp_sending_router *router(uint32_t id) const { return wccp_find_sending_router(group, host(id)); }
     engine_fixture engine;
     wccp_service_group *group = nullptr;
 };
@@ -98,6 +93,9 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         return out;
     };
     const auto with = [](const std::vector<wire_bytes> &components) { return wire_message(11, components); };
+    const auto service = [&](uint32_t priority, uint32_t protocol, uint32_t flags) {
+        return with({security, service_part(51, priority, protocol, flags), identity_part(1)});
+    };
     const auto optional = [](const std::vector<wire_bytes> &more) { return make_icu(1, view(1, {}), more); };
     bytes longer = good, router_0 = make_icu(0, view(1, {}));
     longer.push_back(0);
@@ -117,7 +115,6 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {changed(4, 1), 0, none, "WCCP rxed verion (256) is not supported. sender ip: 10.0.0.1",
          "message-version 10.0.0.1: 0x100|0x200"},
         {changed(3, 10), 0, none, "10.0.0.1", "message-type 10.0.0.1: type 10|11 or 13"}, // a Here-I-Am
-        {changed(3, 12), 0, none, "10.0.0.1", "message-type"},                            // a Redirect-Assign
         {changed(0, 1), 0, none, "10.0.0.1", "message-type"}, // a type of more than 16 bits
         {with({}), 1, all, "WCCP: unloading security info failed."},
         {with({security}), 1, all, "WCCP: unloading service info failed."},
@@ -128,25 +125,19 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         {with({security, service_part()}), 0, bad_icu, "WCCP: unloading router identity failed."},
         {with({security, service_part(), identity_part(1)}), 0, bad_icu,
          "WCCP: unloading router view failed."},
-        {with({security, service_part(51, 201, 17, 3), identity_part(1)}), 0, bad_service,
+        {service(201, 17, 3), 0, bad_service,
          "WCCP GRP 51: service group config mismatch (router id: 10.0.0.1) .priority: rxed = 201 local = "
          "200, protocol: rxed = 17 local = 6, service flags: rxed = 0x3 local =  0x13",
          "service-mismatch 10.0.0.1: priority 201, protocol 17, flags 0x3|priority 200, protocol 6, flags "
          "0x13"},
-        {with({security, service_part(51, 199), identity_part(1)}), 0, bad_service, "config mismatch",
-         "service-"},
-        {with({security, service_part(51, 200, 17), identity_part(1)}), 0, bad_service, "mismatch",
-         "service-"},
-        {with({security, service_part(51, 200, 6, 0x80000013), identity_part(1)}), 0, bad_service,
-         "config mismatch"},
+        {service(199, 6, 0x13), 0, bad_service, "config mismatch", "service-"},
+        {service(200, 17, 0x13), 0, bad_service, "config mismatch", "service-"},
+        {service(200, 6, 0x80000013), 0, bad_service, "config mismatch"},
         {optional({hex("000e 0000")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {optional({hex("000f 0000")}), 0, bad_icu, "WCCP: unloading command ext comp. failed."},
         {optional({hex("0008 0004 00000000")}), 0, bad_icu, "WCCP: unloading capability comp. failed."},
         {optional({hex("0063 0001")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
-        {optional({hex("00")}), 0, bad_icu, "WCCP: unloading unknown component failed."},
         {optional({hex("0063")}), 0, bad_icu, "component type: 99 length 0 "},
-        {optional({hex("0063 00")}), 0, bad_icu, "component type: 99 length 0 "},
-        {optional({hex("000e 00")}), 0, bad_icu, "WCCP: unloading assignment map failed."},
         {optional({by_hash, odd_command, odd_unknown, odd_unknown}), 0, bad_icu,
          "WCCP GRP 51: ICU bogus packet  (too many optional components).",
          "message-malformed 10.0.0.1: 4 optional components|3 at most"},
@@ -175,7 +166,10 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         log.take();
         EXPECT_EQ(process(row.message), row.result);
         EXPECT_EQ(now(), expected);
-        EXPECT_EQ(group->sending_routers, nullptr);
+        EXPECT_EQ((numbers{group->sending_router_count, group->router_view_count, group->appliance_view_count,
+                           group->change_number, group->fwd_method, group->state_flags}),
+                  (numbers{0, 0, 0, 0, 0, WCCP_STATE_INIT}))
+            << "the group is unchanged";
         const std::string reasons = take_reasons(group) + take_reasons(nullptr);
         EXPECT_NE(reasons.find(row.reason), std::string::npos) << reasons;
         EXPECT_EQ(reasons.empty(), row.reason.empty()) << reasons;
@@ -184,13 +178,12 @@ TEST_F(Messages, EachFaultIsCountedInItsPlace) {
         EXPECT_EQ(count_of("processing received packet from 10.0.0.1 failed", lines), row.result);
     }
     const numbers before = now();
-    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u}) {
-        group->admin_state = state;
-        EXPECT_TRUE(process(good) == 0 && log.say("WCCP GRP 51: is disabled. dropping the rxed packet."));
+    for (const uint32_t state : {0u, WCCP_ADMIN_DOWN + 0u, WCCP_ADMIN_UP + 0u}) {
         EXPECT_EQ(now(), before);
+        group->admin_state = state;
+        EXPECT_EQ(process(good), 0);
+        EXPECT_EQ(log.say("GRP 51: is disabled. dropping the rxed packet."), state != WCCP_ADMIN_UP);
     }
-    group->admin_state = WCCP_ADMIN_UP;
-    EXPECT_EQ(process(good), 0);
     EXPECT_NE(router(1), nullptr) << "the message itself is valid";
 }
 
@@ -239,22 +232,17 @@ TEST_F(Messages, ComplaintsAreBoundedForEachInterface) {
 
 // Failures while a valid packet is processed can be repeated as often as invalid packets.
 TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
-    const auto report = [](uint32_t id, uint32_t weight, std::vector<element> seen = {}) {
-        seen.push_back({100, weight, 0});
-        return make_icu(id, view(id, seen), {by_mask});
+    const auto varied = [](uint32_t i) { // with an appliance that the other router does not list
+        return make_icu(1, view(1, {{101 + i % 100, 1, 0}, {100, i % 2 + 1, 0}}), {by_mask});
     };
-    process(report(1, 100));
-    process(report(2, 100));
+    for (const uint32_t id : {1u, 2u})
+        process(make_icu(id, view(id, {{100, 100, 0}}), {by_mask}));
     group->mask_bits = WCCP_MAX_MASK_BITS + 1;
     pass_seconds(1);
     ASSERT_EQ(group->designated, 1u);
-    const uint32_t appliances = group->appliance_view_count;
     const std::pair<const char *, std::function<bytes(uint32_t)>> rows[] = {
-        {"mask assignment: too many bits", [&](uint32_t i) { return report(1, i % 2 + 1); }},
-        {"is not in all sending router views",
-         [&](uint32_t i) {
-             return report(1, i % 2 + 1, {{101 + i % 100, 1, 0}});
-         }},
+        {"mask assignment: too many bits", varied},
+        {"is not in all sending router views", varied},
         {"failed to add tunnel",
          [this](uint32_t i) {
              group->ret_method = WCCP_METHOD_GRE;
@@ -281,34 +269,6 @@ TEST_F(Messages, FailuresCausedByValidPacketsAreComplaintsToo) {
         EXPECT_GT(with_line, 50) << line;
         EXPECT_LE(lines, 200) << line;
     }
-    group->appliance_view_count = appliances;
-}
-
-TEST_F(Messages, ATruncatedISeeYouLeavesTheGroupUnchanged) {
-    process(make_icu(2, view(2, {{100, 100, 0xff}})));
-    const wire_bytes seen = view(1, {{100, 100, 0x11}, {101, 50, 0x22}});
-    const bytes whole = make_icu(1, seen, {by_hash, odd_command, map_part({100, 101})});
-    const size_t mandatory = 8 + 8 + 28 + 24 + seen.size();
-    size_t refused = 0;
-    for (size_t length = 44; length < whole.size(); length++) {
-        const size_t optional = length - mandatory; // a message may end where an optional component does
-        if (length >= mandatory &&
-            (optional == 0 || optional == by_hash.size() || optional == by_hash.size() + 17))
-            continue;
-        bytes cut(whole.begin(), whole.begin() + static_cast<long>(length));
-        cut[6] = static_cast<uint8_t>((length - 8) >> 8);
-        cut[7] = static_cast<uint8_t>(length - 8);
-        const auto before = std::make_unique<wccp_service_group>(*group);
-        const wccp_sending_router router_before = *router(2);
-        EXPECT_EQ(process(cut), 0);
-        before->rx_icus++;
-        before->rx_icu_failures++;
-        memcpy(before->reasons, group->reasons, sizeof group->reasons);
-        EXPECT_EQ(memcmp(before.get(), group, sizeof *group), 0) << length;
-        EXPECT_EQ(memcmp(&router_before, router(2), sizeof router_before), 0) << length;
-        refused++;
-    }
-    EXPECT_TRUE(refused > 200 && process(whole) == 0 && router(1));
 }
 
 TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
@@ -316,7 +276,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
     constexpr uint32_t L2 = WCCP_METHOD_L2, HASH = WCCP_ASSIGN_HASH;
     const wire_bytes seen = view(1, {{100, 100, 0x01}, {101, 50, 0xff}}, 5);
     // Odd lengths put the capabilities at odd addresses.
-    EXPECT_EQ(process(make_icu(1, seen, {odd_unknown, odd_command, by_hash}), make_ipa(7, 7)), 0);
+    EXPECT_EQ(process(make_icu(1, seen, {odd_unknown, odd_command, by_hash}), host(7 << 8 | 7)), 0);
     EXPECT_EQ(take_reasons(group), "");
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
@@ -329,7 +289,7 @@ TEST_F(Messages, AnISeeYouUpdatesRouterAndViews) {
                        group->rx_icu_failures};
     };
     EXPECT_EQ(now(), (numbers{0xa1a2a3a4, 0xc1c2c3c4, 77, 1, 2, 32, 256, L2, HASH, 0, 0}));
-    EXPECT_EQ(made->src_ipa, make_ipa(7, 7));
+    EXPECT_EQ(made->src_ipa, host(7 << 8 | 7));
     EXPECT_TRUE(made->flags & WCCP_RTR_TWO_WAY && group->state_flags & WCCP_STATE_ACTIVE);
     // Another service is only counted.
     wccp_g.seconds = 78;
@@ -343,9 +303,8 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     const std::vector<uint32_t> owners = {100, 100, 101, 102, 102, 100, 101, 101, 101, 100};
     EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101, 100}), {odd_unknown, map_part(owners), by_mask})),
               0);
-    EXPECT_EQ(take_reasons(group),
-              "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst 0x0 "
-              "ports 0x0 0x0");
+    EXPECT_EQ(take_reasons(group), "mask-differs 10.0.0.1: src 0x1741 dst 0xf00 ports 0x1 0x2|src 0x0 dst "
+                                   "0x0 ports 0x0 0x0");
     const wccp_sending_router *made = router(1);
     ASSERT_NE(made, nullptr);
     const auto bits = [made](uint32_t entry) {
@@ -364,8 +323,9 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     group->mask_src_ip = 0x41;
     group->mask_dst_ip = 0x100;
     group->mask_src_port = group->mask_dst_port = 0;
-    for (const auto &[values, in_order] : std::vector<std::pair<numbers, bool>>{
-             {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}}) {
+    const std::pair<numbers, bool> orders[] = {
+        {{0x00100, 0x10000, 0x10100}, false}, {{0, 0x00100, 0x10000}, true}, {{0, 0x10000}, false}};
+    for (const auto &[values, in_order] : orders) {
         wire_bytes ordered = hex("000e 0000 00000001 00000041 00000100 00000000");
         ordered.u32(static_cast<uint32_t>(values.size()));
         for (const uint32_t value : values) // one bit of the source and one of the destination
@@ -374,17 +334,24 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
         EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {ordered})), 0);
         EXPECT_EQ(made->map_in_order, in_order);
     }
+    // The largest one.
+    const size_t others = make_icu(1, mask_view(1, {100, 101}), {map_part({})}).size();
+    numbers largest((WCCP_MAX_PACKET - others) / 16, 101);
+    largest.back() = 100;
+    EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {map_part(largest)})), 0);
+    EXPECT_TRUE(made->self_buckets == 1 && made->total_buckets == largest.size() && largest.size() > 240);
     EXPECT_EQ(process(make_icu(1, mask_view(1, {100, 101}), {map_part({101, 100})})), 0);
     EXPECT_TRUE(bits(0) == 0b10 && bits(1) == 0b01 && made->self_buckets == 1 && !made->map_in_order);
 
-    // A map without mask elements is refused, alone or after a full one, after the views have been updated.
+    // A map without mask elements is refused, alone or after a full one, after the views have been
+    // updated. Without a map the earlier bits stay.
     const wire_bytes empty = hex("000e 0024 00000000"), rest = hex("0063 001c").zeros(28);
     const bytes messages[] = {make_icu(1, mask_view(1, {100}), {empty, rest}),
                               make_icu(1, mask_view(1, {100, 101}), {map_part({100, 100}), empty, rest})};
     for (uint32_t i = 0; i < 2; i++) {
         EXPECT_EQ(process(messages[i]), 0);
         EXPECT_TRUE(group->rx_icu_failures == i + 1 && made->view_appliance_count == i + 1 &&
-                    made->self_buckets == 1);
+                    made->self_buckets == 1 && bits(0) == 0b10);
     }
 
     // Hash elements when mask was agreed.
@@ -392,21 +359,6 @@ TEST_F(Messages, AMapIsStoredInTheRoutersReport) {
     process(make_icu(2, view(2, {{101, 50, 0xff}}), {by_mask}));
     EXPECT_EQ(take_reasons(group), "method-differs 10.0.0.2: hash by the router|mask x2; "
                                    "not-in-view 10.0.0.2: 1 appliance|10.0.0.100");
-}
-
-TEST_F(Messages, AMapThatFillsThePacketIsProcessed) {
-    const size_t room = WCCP_MAX_PACKET - make_icu(1, mask_view(1, {100, 101}), {by_mask}).size() - 24;
-    std::vector<uint32_t> owners(room / 16 - 1, 101);
-    owners.back() = 100;
-    const size_t rest = room - owners.size() * 16 - 4;
-    const wire_bytes filler = hex("0063").u16(static_cast<uint32_t>(rest)).zeros(rest);
-    bytes message = make_icu(1, mask_view(1, {100, 101}), {by_mask, map_part(owners), filler});
-    ASSERT_EQ(message.size(), size_t{WCCP_MAX_PACKET});
-    ASSERT_TRUE(process(message) == 0 && router(1));
-    EXPECT_EQ(std::tuple(router(1)->self_buckets, router(1)->total_buckets, group->rx_icu_failures),
-              std::tuple(1, owners.size(), 0));
-    message[7]++; // the header of a longer message, truncated to the buffer: dropped and not counted
-    EXPECT_TRUE(process(message) == 0 && group->rx_icus == 1 && wccp_g.rx_failures == 0);
 }
 
 TEST_F(Messages, AKeyIsAnAcknowledgementFromTheSecondAssignmentOn) {
@@ -461,19 +413,18 @@ TEST_F(Messages, TheDigestDecides) {
     EXPECT_EQ(process(good), 1);
     group->security_option = 0;
     EXPECT_EQ(process(good), 1);
-    const std::string reasons = "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
-                                "security-unwanted 10.0.0.1: MD5|none";
-    EXPECT_EQ(take_reasons(group), reasons);
+    EXPECT_EQ(take_reasons(group), "password-mismatch 10.0.0.1: | x5; security-missing 10.0.0.1: none|MD5; "
+                                   "security-unwanted 10.0.0.1: MD5|none");
     // An accepted I-See-You ends them, except those of the same second and those of other senders.
-    EXPECT_TRUE(process(good) == 1 && process(good, make_ipa(0, 2)) == 1);
+    EXPECT_TRUE(process(good) == 1 && process(good, host(2)) == 1);
     for (uint32_t second = 0; second < 2; second++, wccp_g.seconds++)
         process(make_icu(1, view(1, {{100, 100, 0}})));
     EXPECT_EQ(take_reasons(group),
               "security-unwanted 10.0.0.2: MD5|none; assignment-not-offered 10.0.0.1: hash|mask x2");
     // Reasons of strangers replace those of strangers, not those of the group's routers.
     EXPECT_EQ(process(good), 1);
-    for (uint8_t i = 0; i < 100; i++, wccp_g.seconds++)
-        process(good, make_ipa(7, i));
+    for (uint32_t i = 0; i < 100; i++, wccp_g.seconds++)
+        process(good, host(7 << 8 | i));
     const std::string all = take_reasons(group);
     EXPECT_EQ(count_of("unwanted 10.0.0.1: ", all) + count_of("10.0.7.99:", all), 2) << all;
     EXPECT_EQ(count_of("10.0.7.0:", all), 0) << all;
@@ -508,9 +459,8 @@ TEST_F(Messages, WhatIsSentReachesEachRouterAndIsCounted) {
     }
     engine.interface->ready_flags = WCCP_ALL_READY;
     group->tx_pkt->ipa = {{255, 255, 255, 255}}; // refused by the kernel: only a result of 0 is a failure
-    EXPECT_EQ(wccp_transmit_packet(group, group->tx_pkt, 25), 0);
-    EXPECT_EQ(wccp_transmit_packet(group, nullptr, 10), 1);
-    EXPECT_TRUE(group->tx_removal_replies == 1 && group->tx_failures == 3);
+    EXPECT_TRUE(wccp_transmit_packet(group, group->tx_pkt, 25) == 0 && group->tx_removal_replies == 1);
+    EXPECT_TRUE(wccp_transmit_packet(group, nullptr, 10) == 1 && group->tx_failures == 3);
     EXPECT_EQ(take_reasons(group), "table-not-built: redirect assign: groups actual assignment method is "
                                    "not set.|; send-failed 255.255.255.255: Permission denied|108 bytes");
     EXPECT_EQ(engine.sent_to("10.0.0.1"), bytes{});

@@ -2,6 +2,7 @@
 // where the test has the routers' sockets. Includes what most tests of the engine call.
 #pragma once
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <new>
@@ -45,8 +46,7 @@ inline void end_engine() {
     cthread_cancel_all();
     wccpd_exiting = 0;
     wccp_del_all_groups();
-    EXPECT_EQ(wccp_g.group_count, 0u);
-    EXPECT_EQ(wccp_g.group_list, nullptr);
+    EXPECT_TRUE(wccp_g.group_count == 0 && !wccp_g.group_list);
     wccp_del_all_tunnels();
     EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
     wccp_deinit_link_mgr();
@@ -86,8 +86,7 @@ inline received_packet make_received(const std::vector<uint8_t> &bytes, be32 fro
     pkt->ipa = from;
     pkt->length = static_cast<uint32_t>(bytes.size());
     pkt->cursor = pkt->data;
-    if (!bytes.empty())
-        memcpy(pkt->data, bytes.data(), bytes.size());
+    std::copy(bytes.begin(), bytes.end(), pkt->data);
     ASAN_POISON_MEMORY_REGION(pkt->data + bytes.size(), sizeof pkt->data - bytes.size());
     return pkt;
 }
@@ -116,7 +115,8 @@ struct engine_fixture {
     engine_fixture &operator=(const engine_fixture &) = delete;
 
     // An enabled group without tunnels: L2, either assignment, IOS, weight 100.
-    static wccp_grp_config group_config(uint8_t id, const std::vector<std::string> &routers) {
+    static wccp_grp_config group_config(uint8_t id, const std::vector<std::string> &routers,
+                                        const char *interface = "wan0") {
         wccp_grp_config config = {};
         config.group_id = id;
         for (const std::string &router : routers)
@@ -126,13 +126,20 @@ struct engine_fixture {
         config.fwd_method = WCCP_METHOD_L2;
         config.assign_method = WCCP_ASSIGN_EITHER;
         config.interface_set = 1;
-        strcpy(config.interface, "wan0");
+        strlcpy(config.interface, interface, sizeof config.interface);
         config.compatibility = WCCP_COMPAT_IOS;
         return config;
     }
     wccp_service_group *add_group(const wccp_grp_config &config) const {
         EXPECT_EQ(wccp_add_group(&config), 0);
         return wccp_find_group(config.group_id);
+    }
+    static void set_admin(uint8_t id, uint32_t state) {
+        wccp_grp_config update = {};
+        update.group_id = id;
+        update.config_flags = WCCP_CFG_ADMIN;
+        update.admin = state;
+        EXPECT_EQ(wccp_modify_grp(&update), 0);
     }
     // Adds an address on the routers' side and opens its socket on port 2048.
     int router_socket(const std::string &address) {
