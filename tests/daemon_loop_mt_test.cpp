@@ -44,27 +44,6 @@ struct loop_thread {
     }
 };
 
-TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
-    for (const bool nested : {false, true}) {
-        loop_thread it;
-        std::atomic<int> inner{-1};
-        if (nested)
-            it.first = [&] {
-                int escaped = 0;
-                while (!escaped)
-                    ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, &escaped), LC_OK);
-                inner = escaped;
-            };
-        it.start();
-        usleep(50000);
-        const int64_t start = lt_monotonic_ms();
-        EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
-        it.finish();
-        EXPECT_LT(lt_monotonic_ms() - start, 2000);
-        EXPECT_TRUE(it.escaped == 1 && inner == (nested ? 1 : -1));
-    }
-}
-
 struct counts {
     std::atomic<int> carried{0}, withdrawn{0};
 };
@@ -118,25 +97,30 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
 }
 
 // Posted work ends a wait for one round, because it may have changed what is waited for.
-TEST(LoopThreads, PostedWorkEndsANestedWait) {
-    counts all;
-    std::atomic<int> waiting{0};
-    int expected = 0;
-    loop_thread it;
-    it.first = [&] {
-        waiting = 1;
-        while (!all.carried)
-            ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, nullptr), LC_OK);
-        ASSERT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
-    };
-    it.start();
-    while (!waiting)
-        usleep(1000);
-    usleep(20000);
-    const int64_t start = lt_monotonic_ms();
-    counted_post::send(&all, it.loop, 0, &expected);
-    it.finish();
-    EXPECT_LT(lt_monotonic_ms() - start, 2000);
+TEST(LoopThreads, PostedWorkAndEscapesEndTheWaitAtEachDepth) {
+    for (const bool nested : {false, true}) {
+        counts all;
+        std::atomic<int> ended{0}; // waits of the callback
+        int expected = 0;
+        loop_thread it;
+        if (nested)
+            it.first = [&] {
+                int escaped = 0;
+                for (; !all.carried || !escaped; ended = escaped + 1)
+                    ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, &escaped), LC_OK);
+            };
+        it.start();
+        usleep(50000);
+        const int64_t start = lt_monotonic_ms();
+        counted_post::send(&all, it.loop, 0, &expected);
+        while (ended < (nested ? 1 : 0))
+            usleep(1000);
+        usleep(20000);
+        EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+        it.finish();
+        EXPECT_LT(lt_monotonic_ms() - start, 2000);
+        EXPECT_TRUE(all.carried == 1 && it.escaped == 1 && ended == (nested ? 2 : 0));
+    }
 }
 
 } // namespace

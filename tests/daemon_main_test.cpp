@@ -2,7 +2,6 @@
 #include "daemon/wccpd_main.h"
 
 #include <csignal>
-#include <fstream>
 
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -12,16 +11,11 @@
 #include "platform/limits.h"
 #include "runtime/service_notify.h"
 #include "tests/support/daemon_engine.h"
+#include "tests/support/texts.h"
 
 namespace {
 
 constexpr const char *PID_FILE = "/var/run/wccpd.pid";
-
-std::string read_content(const char *path) {
-    std::ostringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
-}
 
 struct DaemonMain : daemon_test {
     void TearDown() override { unlink(PID_FILE); }
@@ -30,13 +24,13 @@ struct DaemonMain : daemon_test {
 TEST_F(DaemonMain, ThePidFile) {
     std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
     EXPECT_EQ(wccpd_pid_init(), LC_OK);
-    EXPECT_EQ(read_content(PID_FILE), std::to_string(getpid()) + "\n");
+    EXPECT_EQ(text_of_file(PID_FILE), std::to_string(getpid()) + "\n");
     unlink(PID_FILE);
     std::ofstream("/tmp/precious") << "kept";
     ASSERT_EQ(symlink("/tmp/precious", PID_FILE), 0);
     EXPECT_EQ(wccpd_pid_init(), LC_BAD_FILE);
     EXPECT_EQ(said("Writing /var/run/wccpd.pid: Too many levels of symbolic links"), 1);
-    EXPECT_EQ(read_content("/tmp/precious"), "kept");
+    EXPECT_EQ(text_of_file("/tmp/precious"), "kept");
 }
 
 TEST_F(DaemonMain, EncapsulationRanges) {
@@ -83,10 +77,6 @@ TEST_F(DaemonMain, ReportsToItsServiceManager) {
     wccpd_service_deinit();
     EXPECT_EQ(lew_deinit(&wccpd_lwc), LC_OK);
     close(manager);
-}
-
-TEST_F(DaemonMain, NothingStartsWithoutALoop) {
-    EXPECT_TRUE(wccpd_serv_init() == LC_ASSERTION && wccpd_main_loop() == LC_NULL);
 }
 
 } // namespace
