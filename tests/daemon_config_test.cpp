@@ -15,19 +15,13 @@ struct DaemonConfig : daemon_test {
     static lc_status change(const std::string &name, uint32_t type, std::string text, uint32_t flags = 0) {
         return apply(binding_list().add(name, type, text, flags));
     }
-    static lc_status change_51(const std::string &node, uint32_t type, const std::string &text) {
-        return change(CONFIG + "51/" + node, type, text);
-    }
     static void delete_root(const std::string &id) {
         EXPECT_EQ(change(CONFIG + id, bn_type_uint8, "51", bn_flag_deleted), LC_OK);
     }
-    // A configuration after one node of a group.
-    static wccp_grp_config with_node(wccp_grp_config config, int kind, const std::string &text,
-                                     uint32_t type = bn_type_str) {
-        EXPECT_EQ(
-            wccpd_config_update_group_binding(&config, binding_list().add("/x", type, text).last(), kind),
-            LC_OK);
-        return config;
+    // Applies one node to the configuration of a group.
+    static void take_node(wccp_grp_config *config, int kind, uint32_t type, const std::string &text) {
+        binding_list list;
+        EXPECT_EQ(wccpd_config_update_group_binding(config, list.add("/x", type, text).last(), kind), LC_OK);
     }
     // A group's root node and its interface.
     static binding_list &add_root(binding_list &list, const std::string &id) {
@@ -104,17 +98,17 @@ TEST_F(DaemonConfig, OneNodeOfARunningGroup) {
     std::vector<uint32_t> expected = fields();
     for (size_t changed = 0; changed < std::size(nodes); changed++) {
         const auto &node = nodes[changed];
-        EXPECT_EQ(change_51(node.node, node.type, node.text), LC_OK);
+        EXPECT_EQ(change(CONFIG + "51/" + node.node, node.type, node.text), LC_OK);
         EXPECT_EQ(said("WCCP update: Unknown binding " + CONFIG + "51/" + node.node), !node.changes);
         if (node.changes)
             expected[changed] = node.wanted;
         EXPECT_EQ(fields(), expected) << node.node;
     }
     engine.log.clear();
-    EXPECT_EQ(change_51("password", bn_type_str, ""), LC_OK);
+    EXPECT_EQ(change(CONFIG + "51/password", bn_type_str, ""), LC_OK);
     EXPECT_TRUE(group->security_option == 0 && group->password[0] == 0);
     for (const char *node : {"assign_detail", "interface"})
-        EXPECT_EQ(change_51(node, bn_type_str, "wan0"), LC_OK);
+        EXPECT_EQ(change(CONFIG + "51/" + node, bn_type_str, "wan0"), LC_OK);
     EXPECT_EQ(group->interfaces[0], engine.interface);
     EXPECT_EQ(said("<139>"), 0); // facility local1, level error
     EXPECT_EQ(change(CONFIG + "61/weight", bn_type_uint32, "7"), LC_OK);
@@ -135,7 +129,9 @@ TEST_F(DaemonConfig, ProtocolsByNameAndNumber) {
     };
     for (const auto &[protocol, texts] : cases)
         for (const char *text : texts) {
-            const wccp_grp_config config = with_node({.protocol = 99}, GROUP_NODE_PROTOCOL, text);
+            wccp_grp_config config = {};
+            config.protocol = 99;
+            take_node(&config, GROUP_NODE_PROTOCOL, bn_type_str, text);
             EXPECT_TRUE(config.protocol == protocol && config.config_flags == 0) << text;
         }
     EXPECT_EQ(said("Bad wccp protocol: 256"), 1);
@@ -153,16 +149,16 @@ TEST_F(DaemonConfig, WordsAreComparedExactly) {
              "Invalid compatibility mode: Ios, using ios"},
             {12, "x", &wccp_grp_config::admin, 77, 0, "node type 12 unknown"},
         };
-    wccp_grp_config config;
+    wccp_grp_config config = {};
+    take_node(&config, GROUP_NODE_INTERFACE, bn_type_str, "sixteen letters.");
+    EXPECT_TRUE(config.interface == std::string("sixteen letters") && config.interface_set == 1);
     for (const auto &[kind, text, field, value, flags, line] : cases) {
         config = {};
         config.*field = 77;
-        config = with_node(config, kind, text);
+        take_node(&config, kind, bn_type_str, text);
         EXPECT_TRUE(config.*field == value && config.config_flags == flags) << text;
         EXPECT_EQ(said(std::string("WCCP config: ") + line), 1) << line;
     }
-    config = with_node({}, GROUP_NODE_INTERFACE, "sixteen letters.");
-    EXPECT_TRUE(config.interface == std::string("sixteen letters") && config.interface_set == 1);
 }
 
 TEST_F(DaemonConfig, RoutersInTheOrderOfTheirNumbersWithoutAGap) {
@@ -179,7 +175,7 @@ TEST_F(DaemonConfig, RoutersInTheOrderOfTheirNumbersWithoutAGap) {
     wccp_grp_config config = {};
     for (uint32_t number = 1; number <= WCCP_MAX_ROUTERS + 1; number++) {
         config.config_flags = 0;
-        config = with_node(config, GROUP_NODE_ROUTER, "10.0.1." + std::to_string(number), bn_type_ipv4addr);
+        take_node(&config, GROUP_NODE_ROUTER, bn_type_ipv4addr, "10.0.1." + std::to_string(number));
         EXPECT_EQ(config.config_flags, WCCP_CFG_ROUTERS);
     }
     EXPECT_TRUE(config.router_count == WCCP_MAX_ROUTERS && config.routers[31] == address(0x120));

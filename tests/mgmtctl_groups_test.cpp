@@ -87,18 +87,15 @@ void expect_refused(Result (fake::*command)(const std::string &), int exit, cons
 } // namespace
 
 TEST(Groups, WrongWordsChangeNothingAndAreTold) {
-    const auto check = [](int exit, const char *words, const char *told) {
-        expect_refused(&fake::group, exit, words, told);
-    };
-    check(CTL_USAGE, "add 52 wieght 7", "did you mean \"weight\"?");
-    check(CTL_USAGE, "add 52 zzzzzzzz 7", "known are");
-    check(CTL_USAGE, "ad 52", "did you mean \"add\"?");
-    check(CTL_USAGE, "add 5x", "group add N");
-    check(CTL_USAGE, "add 52 weight", "needs a value: 0 to 65535");
-    check(CTL_USAGE, "set 51 router 10.0.0.1 router 10.0.0.1", "given twice");
-    check(CTL_REFUSED, "add 51", "there is a group 51");
-    check(CTL_NOT_FOUND, "restart 52", "there is no group 52");
-    check(CTL_USAGE, "restart 51 now", "group add N");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 wieght 7", "did you mean \"weight\"?");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 zzzzzzzz 7", "known are");
+    expect_refused(&fake::group, CTL_USAGE, "ad 52", "did you mean \"add\"?");
+    expect_refused(&fake::group, CTL_USAGE, "add 5x", "group add N");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 weight", "needs a value: 0 to 65535");
+    expect_refused(&fake::group, CTL_USAGE, "set 51 router 10.0.0.1 router 10.0.0.1", "given twice");
+    expect_refused(&fake::group, CTL_REFUSED, "add 51", "there is a group 51");
+    expect_refused(&fake::group, CTL_NOT_FOUND, "restart 52", "there is no group 52");
+    expect_refused(&fake::group, CTL_USAGE, "restart 51 now", "group add N");
 }
 
 TEST(Groups, OneCommitWhereARunningGroupFollows) {
@@ -144,25 +141,22 @@ TEST(Groups, AsAWholeItIsOneCommitAsWell) {
 static const std::string INTERCEPT = NODE_INTERCEPT_CONFIG "/51";
 
 TEST(Intercepts, WrongClausesChangeNothingAndAreTold) {
-    const auto check = [](const char *words, const char *told) {
-        expect_refused(&fake::intercept, CTL_USAGE, words, told);
-    };
-    check("ad 51", "did you mean \"add\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "ad 51", "did you mean \"add\"?");
     for (const char *words : {"add 51", "set 51", "delete 51 to 1", "add 5x all to 3128"})
-        check(words, "intercept add GROUP");
-    check("add 51 port 80", "\"to\" is missing");
-    check("add 51 to 80", "\"all\" is missing");
-    check("add 51 port to 80", "\"port\" needs a value");
-    check("add 51 port 80 all to 1", "exclude each other");
-    check("add 51 port 80 tp 3128", "did you mean \"to\"?");
-    check("set 51 to none", "\"to\" needs a value");
-    check("set 51 rise 2 rise 3", "given twice");
-    check("set 51 check htp /", "did you mean \"http\"?");
-    check("set 51 check http rise 2", "needs the path of a page");
-    check("add 51 all port 80 to 1", "\"all\" exclude each other");
-    check("add 51 all all to 1", "\"all\" is given twice");
-    check("show x", "intercept show [GROUP]");
-    check("set 51 bypass", "\"bypass\" needs a value");
+        expect_refused(&fake::intercept, CTL_USAGE, words, "intercept add GROUP");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80", "\"to\" is missing");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 to 80", "\"all\" is missing");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port to 80", "\"port\" needs a value");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80 all to 1", "exclude each other");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80 tp 3128", "did you mean \"to\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 to none", "\"to\" needs a value");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 rise 2 rise 3", "given twice");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 check htp /", "did you mean \"http\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 check http rise 2", "needs the path of a page");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 all port 80 to 1", "\"all\" exclude each other");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 all all to 1", "\"all\" is given twice");
+    expect_refused(&fake::intercept, CTL_USAGE, "show x", "intercept show [GROUP]");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 bypass", "\"bypass\" needs a value");
     expect_refused(&fake::intercept, CTL_NOT_FOUND, "set 51 rise 2", "no intercept for group 51");
 }
 
@@ -206,15 +200,12 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
 }
 
 TEST(Bypasses, HaveOneNameAndEndByThemselves) {
-    const auto refuse = [](const char *words, const char *told) {
-        expect_refused(&fake::bypass, CTL_USAGE, words, told);
-    };
-    refuse("add 10.0.0.1/8", "host bits");
-    refuse("add 10.0.0.0/8 fro 60", "did you mean \"for\"?");
-    refuse("add 10.0.0.0/8 for 0", "number of seconds");
-    refuse("add 10.0.0.0/8 for 4294967296", "number of seconds");
-    refuse("add 10.0.0.0/8 for", "bypass add PREFIX");
-    refuse("delete 10.0.0.0/8 for 1", "bypass add PREFIX");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.1/8", "host bits");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 fro 60", "did you mean \"for\"?");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for 0", "number of seconds");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for 4294967296", "number of seconds");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for", "bypass add PREFIX");
+    expect_refused(&fake::bypass, CTL_USAGE, "delete 10.0.0.0/8 for 1", "bypass add PREFIX");
     fake mgmtd;
     EXPECT_EQ(mgmtd.bypass("add 10.0.0.0/08").exit, CTL_OK);
     EXPECT_EQ(mgmtd.sent(NODE_BYPASS_CONFIG), "create /10.0.0.0\\/8=;");
@@ -226,13 +217,10 @@ TEST(Bypasses, HaveOneNameAndEndByThemselves) {
 }
 
 TEST(Tunnels, FurtherSourcesAreAcceptedAndTakenBack) {
-    const auto refuse = [](const char *words, const char *told) {
-        expect_refused(&fake::tunnel, CTL_USAGE, words, told);
-    };
-    refuse("acept 10.0.0.9", "did you mean \"accept\"?");
-    refuse("accept 10.0.0", "\"10.0.0\" is no IPv4 address");
-    refuse("accept 10.0.0.9 for 9", "known are router");
-    refuse("refuse 10.0.0.9 router 10.0.0.1", "tunnel accept ADDRESS");
+    expect_refused(&fake::tunnel, CTL_USAGE, "acept 10.0.0.9", "did you mean \"accept\"?");
+    expect_refused(&fake::tunnel, CTL_USAGE, "accept 10.0.0", "\"10.0.0\" is no IPv4 address");
+    expect_refused(&fake::tunnel, CTL_USAGE, "accept 10.0.0.9 for 9", "known are router");
+    expect_refused(&fake::tunnel, CTL_USAGE, "refuse 10.0.0.9 router 10.0.0.1", "tunnel accept ADDRESS");
     fake mgmtd;
     mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8"] = "10.0.0.8";
     mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8/router"] = "10.0.0.1";

@@ -122,26 +122,10 @@ struct FdicBridge : testing::Test {
     }
 };
 
-TEST_F(FdicBridge, InterestsFollowTheirChanges) {
-    const int32_t id = add(1, 0);
-    EXPECT_EQ(calls, "4:44 ");
-    ASSERT_EQ(write(ends[1], "x", 1), 1);
-    expect_round("1:1 ");
-    EXPECT_EQ(fdic_event_update_fd(list, id, 0, 1), LC_OK);
-    expect_round("2:2 ");
-    EXPECT_EQ(fdic_event_update_fd(list, id, 1, 1), LC_OK);
-    expect_round("1:1 2:2 ");
-    calls.clear();
-    EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK);
-    EXPECT_EQ(calls, "5:55 ");
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
-}
-
 TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
     gcl_log log;
     const int32_t id = add(1, 1);
+    EXPECT_EQ(calls, "4:44 ");
     ASSERT_EQ(write(ends[1], "x", 1), 1);
     for (const lc_status status : {LC_BAD_TYPE, LC_CANCELLED}) { // a failure ends this round of calls
         on_call = [status](uint32_t) { return status; };
@@ -152,6 +136,8 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
         return kind == FDIC_READABLE ? fdic_event_delete_fd(list, id) : LC_OK;
     };
     expect_round("1:1 5:55 2:2 ");
+    int none = 0;
+    EXPECT_TRUE(lew_dispatch(wrapper, &none, nullptr) == LC_OK && none == 1);
 }
 
 TEST_F(FdicBridge, TimersFireOnce) {
@@ -160,8 +146,7 @@ TEST_F(FdicBridge, TimersFireOnce) {
     ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, as_pointer(3), &id), LC_OK);
     expect_round("3:3 ");
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
-    EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
+    EXPECT_TRUE(lew_dispatch_once(wrapper, &none, nullptr) == LC_OK && none == 1);
     // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
     ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, as_pointer(9), &soon), LC_OK);

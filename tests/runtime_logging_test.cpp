@@ -2,7 +2,6 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <fstream>
 #include <regex>
 
 #include <sys/stat.h>
@@ -10,6 +9,7 @@
 
 #include "runtime/logging_levels.h"
 #include "tests/support/log_daemon.h"
+#include "tests/support/texts.h"
 
 namespace {
 
@@ -19,13 +19,6 @@ constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
 void set_link(const char *target) {
     unlink(LINK);
     ASSERT_EQ(symlink(target, LINK), 0);
-}
-void write_file(const char *path, const std::string &text) {
-    std::ofstream(path) << text;
-}
-std::string read_file(const char *path) {
-    std::ifstream file(path);
-    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 // The text after the syslog head and the thread mark.
@@ -52,6 +45,7 @@ struct Log : testing::Test {
                    uint8_t destinations = 1) {
         return lc_log_init(name, prefix, flags, 0x1060000, 7, 136, destinations);
     }
+    void SetUp() override { ASSERT_EQ(init(), LC_OK); }
     void TearDown() override {
         unlink(LINK);
         (void)lc_log_close();
@@ -59,7 +53,8 @@ struct Log : testing::Test {
 };
 
 // The first test: nothing in this process has logged yet.
-TEST_F(Log, TheFirstLineSetsUpTheLog) {
+TEST(UnopenedLog, IsSetUpByTheFirstLine) {
+    log_daemon daemon;
     ASSERT_EQ(G_log_state_lock, nullptr);
     LC_LOG(LC_LOG_NOTICE, "early");
     EXPECT_TRUE(matches_regex(daemon.one(), "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: "
@@ -67,7 +62,6 @@ TEST_F(Log, TheFirstLineSetsUpTheLog) {
 }
 
 TEST_F(Log, ALineHasTheBytesOfVsyslog) {
-    ASSERT_EQ(init(), LC_OK);
     for (const size_t length : {5u, 1000u, 9000u}) {
         const std::string text(length, 'x');
         std::string theirs, ours;
@@ -88,7 +82,6 @@ TEST_F(Log, ALineHasTheBytesOfVsyslog) {
 }
 
 TEST_F(Log, TheBodyOfALine) {
-    ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_NOTICE, "100%% of %s", "%s");
     EXPECT_EQ(body_of(daemon.one()), "[wccpd.NOTICE]: 100% of %s\n");
     util_log(LC_LOG_ERR, "pre: ", "%d%%", 5);
@@ -105,7 +98,6 @@ TEST_F(Log, TheBodyOfALine) {
 }
 
 TEST_F(Log, WhatDoesNotFitIsCut) {
-    ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_ERR, "%s", std::string(2000, 'y').c_str());
     EXPECT_EQ(body_of(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
     // Cuts the format at each position around its conversion.
@@ -123,7 +115,6 @@ TEST_F(Log, WhatDoesNotFitIsCut) {
 }
 
 TEST_F(Log, LevelsAndTheirOrder) {
-    ASSERT_EQ(init(), LC_OK);
     EXPECT_EQ(lc_log_set_max_log_level("debug"), LC_OK);
     static const std::pair<int32_t, int32_t> levels[] = {{3, 3}, {0, 0}, {-1, 7}}; // own, and what passes
     for (const auto &[own, passes] : levels) {
@@ -151,7 +142,6 @@ TEST_F(Log, LevelsAndTheirOrder) {
 }
 
 TEST_F(Log, TheOverrideAppliesWhileBothSwitchesAreOn) {
-    ASSERT_EQ(init(), LC_OK);
     const auto expect = [](lc_status status, int32_t level) {
         EXPECT_EQ(status, LC_OK);
         EXPECT_EQ(G_log_level, level);
@@ -186,7 +176,7 @@ TEST_F(Log, TheLevelLink) {
 TEST_F(Log, UnmanagedProcessesFollowTheFiles) {
     for (const bool polls : {true, false}) {
         set_link("4");
-        write_file(ZONE, "one");
+        std::ofstream(ZONE) << "one";
         setenv("TZ", "XXX-5", 1);
         ASSERT_EQ(init(polls ? "poller" : "wccpd"), LC_OK);
         LC_LOG(LC_LOG_ERR, "one");
@@ -214,7 +204,6 @@ TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
 }
 
 TEST_F(Log, AfterTheCloseLinesAreDropped) {
-    ASSERT_EQ(init(), LC_OK);
     EXPECT_EQ(lc_log_close(), LC_OK);
     EXPECT_EQ(lc_log_close(), LC_NULL);
     EXPECT_EQ(lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "x"), LC_GENERIC);
@@ -225,16 +214,16 @@ TEST_F(Log, AfterTheCloseLinesAreDropped) {
 TEST(Files, TheFacilityAndTheDebugLog) {
     static constexpr const char *FACILITY = "/var/opt/rvl/syslog_fac.conf", *DEBUG = "/var/log/debug_log";
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 136);
-    write_file(FACILITY, "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n");
+    std::ofstream(FACILITY) << "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n";
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 160);
     EXPECT_EQ(lc_log_get_facility(nullptr, "mgmtctl"), 136);
-    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
+    EXPECT_TRUE(matches_regex(text_of_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
     unlink(FACILITY);
-    write_file(DEBUG, std::string(1999999, 'x') + "\n");
+    std::ofstream(DEBUG) << std::string(1999999, 'x') << "\n";
     EXPECT_EQ(lc_log_file(nullptr, "%d", 1), 0);
     EXPECT_GT(std::filesystem::file_size(DEBUG), 2000000u);
     EXPECT_EQ(lc_log_file(nullptr, "%d", 2), 0); // too large to append to
-    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} 2\n"));
+    EXPECT_TRUE(matches_regex(text_of_file(DEBUG), "\\d{6} \\d{6} 2\n"));
     EXPECT_EQ(lc_log_file("/no/such/directory", "x"), 1);
     unlink(DEBUG);
 }
