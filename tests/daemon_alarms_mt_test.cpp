@@ -119,8 +119,7 @@ void live_and_end(bool session_is_lost) {
         cthread *thread = cthread_init("sender", engine_thread, &group, nullptr, nullptr, 0, 0, 0, 0);
         ASSERT_EQ(cthread_start(thread), 0);
     }
-    EXPECT_EQ(qv_alm_mgmt_init("wccpd"), LC_OK);
-    EXPECT_NE(qv_alm_mgmt_session.load(), nullptr);
+    EXPECT_TRUE(qv_alm_mgmt_init("wccpd") == LC_OK && qv_alm_mgmt_session.load());
     while (!(session_is_lost ? provider.over : provider.enough))
         usleep(session_is_lost ? 20000 : 1000);
     usleep(20000);

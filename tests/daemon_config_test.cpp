@@ -134,8 +134,7 @@ TEST_F(DaemonConfig, ProtocolsByNameAndNumber) {
             take_node(&config, GROUP_NODE_PROTOCOL, bn_type_str, text);
             EXPECT_TRUE(config.protocol == protocol && config.config_flags == 0) << text;
         }
-    EXPECT_EQ(said("Bad wccp protocol: 256"), 1);
-    EXPECT_EQ(said("WCCP config: Bad wccp protocol"), 0);
+    EXPECT_TRUE(said("Bad wccp protocol: 256") == 1 && said("WCCP config: Bad wccp protocol") == 0);
 }
 
 TEST_F(DaemonConfig, WordsAreComparedExactly) {
@@ -203,8 +202,7 @@ TEST_F(DaemonConfig, AWrongTypeEndsTheWalkAndKeepsWhatWasApplied) {
     EXPECT_TRUE(apply(list) != LC_OK && group->weight == 5 && said("WCCP Modify config complete") == 0);
     add_root(add_root(roots, "52"), "53").add(CONFIG + "53/weight", bn_type_str, "5");
     add_root(roots, "54");
-    EXPECT_NE(apply(roots), LC_OK);
-    EXPECT_TRUE(wccp_find_group(52) && !wccp_find_group(53) && !wccp_find_group(54));
+    EXPECT_TRUE(apply(roots) != LC_OK && wccp_find_group(52) && !wccp_find_group(53) && !wccp_find_group(54));
 }
 
 // A policy root does not.
@@ -333,8 +331,7 @@ TEST_F(DaemonConfig, ChangesOfTheStartAreAppliedAfterIt) {
 }
 
 TEST_F(DaemonConfig, TheLogFacilityAndNoOtherLogSetting) {
-    EXPECT_EQ(lc_log_set_max_log_level("err"), LC_OK);
-    EXPECT_EQ(lc_log_enable_override_log_level(1, 1), LC_OK);
+    EXPECT_TRUE(lc_log_set_max_log_level("err") == LC_OK && lc_log_enable_override_log_level(1, 1) == LC_OK);
     EXPECT_EQ(lc_log_set_override_log_level("info"), LC_OK);
     EXPECT_EQ(change("/logging/syslog/facility/system", bn_type_uint32, "160"), LC_OK);
     EXPECT_EQ(said("system facility to 20(local4), wccpd"), 1);

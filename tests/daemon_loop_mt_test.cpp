@@ -25,8 +25,7 @@ struct loop_thread {
             self->first();
     }
     void run() {
-        ASSERT_EQ(lew_init(&wrapper), LC_OK);
-        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
+        ASSERT_TRUE(lew_init(&wrapper) == LC_OK && lew_get_event_context(wrapper, &loop) == LC_OK);
         ASSERT_EQ(loop_event_new(loop, run_first, this, &starter), LC_OK);
         ASSERT_EQ(loop_event_set_timer(starter, 0), LC_OK);
         ready = 1;

@@ -168,8 +168,7 @@ TEST(Html, GroupsThatNeedAttentionAreUnfoldedAndFirst) {
     page = draw_page(shown, ORIGIN);
     EXPECT_TRUE(contains(page, "<h1>3 of 6 groups need attention</h1>",
                          "10.0.0.1 signs its messages with another password"));
-    EXPECT_EQ(count_of(page, "<details open>"), 3u);
-    EXPECT_EQ(count_of(page, "<details>"), 3u);
+    EXPECT_TRUE(count_of(page, "<details open>") == 3 && count_of(page, "<details>") == 3);
     EXPECT_LT(page.find("id=\"group-6\""), page.find("id=\"group-1\""));
 }
 
@@ -232,8 +231,7 @@ TEST(Html, AFileIsReplacedAsAWholeOrNotAtAll) {
     chmod(file.c_str(), 0604);
     std::filesystem::create_symlink("page.html", link);
     ASSERT_TRUE(write_page_file(link, "new", &reason)) << reason;
-    EXPECT_TRUE(std::filesystem::is_symlink(link));
-    EXPECT_EQ(mode_of(file), 0604);
+    EXPECT_TRUE(std::filesystem::is_symlink(link) && mode_of(file) == 0604);
 
     signal(SIGXFSZ, SIG_IGN);
     rlimit before;
@@ -242,7 +240,6 @@ TEST(Html, AFileIsReplacedAsAWholeOrNotAtAll) {
     setrlimit(RLIMIT_FSIZE, &small);
     EXPECT_FALSE(write_page_file(file, std::string(5000, 'x'), &reason));
     setrlimit(RLIMIT_FSIZE, &before);
-    EXPECT_EQ(reason, "File too large");
-    EXPECT_EQ(text_of_file(file), "new");
+    EXPECT_TRUE(reason == "File too large" && text_of_file(file) == "new");
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(directory), {}), 2) << "a file is left over";
 }

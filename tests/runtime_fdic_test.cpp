@@ -102,8 +102,7 @@ struct FdicBridge : testing::Test {
         ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
     }
     void TearDown() override {
-        EXPECT_EQ(fdic_libevent_deinit(&bridge), LC_OK);
-        EXPECT_EQ(fdic_deinit(&list), LC_OK);
+        EXPECT_TRUE(fdic_libevent_deinit(&bridge) == LC_OK && fdic_deinit(&list) == LC_OK);
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
         close(ends[0]);
         close(ends[1]);
