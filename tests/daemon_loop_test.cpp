@@ -31,55 +31,48 @@ struct Loop : testing::Test {
 // An event that counts its runs and performs an action of the test.
 struct watched {
     loop_event *event = nullptr;
-    int runs = 0;
+    int runs = 0, ends[2] = {-1, -1};
     std::function<void()> action;
     void make(loop_context *loop, std::function<void()> then) {
         action = std::move(then);
         ASSERT_EQ(loop_event_new(loop, fired, this, &event), LC_OK);
     }
-    static void fired(int fd, short flags, void *data) {
-        auto *self = static_cast<watched *>(data);
-        char byte;
-        if (flags == LOOP_READ)
-            (void)!read(fd, &byte, 1);
-        else
-            EXPECT_EQ(flags, LOOP_TIMEOUT);
-        self->runs++;
-        if (self->action)
-            self->action();
-    }
-    ~watched() { loop_event_free(&event); }
-};
-// On a pipe that holds a byte until the event has run.
-struct readable : watched {
-    int ends[2] = {-1, -1};
+    // On a pipe that holds a byte until the event has run.
     void start(loop_context *loop, std::function<void()> then = nullptr) {
         make(loop, std::move(then));
         ASSERT_TRUE(pipe(ends) == 0 && loop_event_set_fd(event, ends[0], LOOP_READ) == LC_OK);
         fill();
     }
     void fill() const { ASSERT_EQ(write(ends[1], "x", 1), 1); }
-    ~readable() {
+    void start_timer(loop_context *loop, int64_t delay, std::function<void()> then = nullptr) {
+        make(loop, std::move(then));
+        ASSERT_EQ(loop_event_set_timer(event, delay), LC_OK);
+    }
+    static void fired(int fd, short flags, void *data) {
+        auto *self = static_cast<watched *>(data);
+        char byte;
+        EXPECT_TRUE(flags == LOOP_TIMEOUT || (flags == LOOP_READ && fd == self->ends[0]));
+        if (flags == LOOP_READ)
+            (void)!read(fd, &byte, 1);
+        self->runs++;
+        if (self->action)
+            self->action();
+    }
+    ~watched() {
         loop_event_free(&event);
         close(ends[0]);
         close(ends[1]);
     }
 };
-struct timer : watched {
-    void start(loop_context *loop, int64_t delay, std::function<void()> then = nullptr) {
-        make(loop, std::move(then));
-        ASSERT_EQ(loop_event_set_timer(event, delay), LC_OK);
-    }
-};
 
 TEST_F(Loop, EndsWhenNothingIsRegistered) {
     EXPECT_TRUE(whole() == "no events" && once() == "no events");
-    timer only; // after it has fired, no event is left
-    only.start(loop, 30);
+    watched only; // after it has fired, no event is left
+    only.start_timer(loop, 30);
     const int64_t start = lt_monotonic_ms();
     EXPECT_EQ(whole(), "no events");
     EXPECT_TRUE(only.runs == 1 && lt_monotonic_ms() - start >= 25);
-    readable gone; // closed: reported as ready, and removes itself
+    watched gone; // closed: reported as ready, and removes itself
     gone.start(loop, [&] { loop_event_free(&gone.event); });
     close(gone.ends[0]);
     EXPECT_TRUE(whole() == "no events" && gone.runs == 1);
@@ -90,10 +83,10 @@ TEST_F(Loop, EndsWhenNothingIsRegistered) {
 
 // It ends the round as well: of two callbacks that are due, only one runs.
 TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
-    readable first, second, inner[2];
+    watched first, second, inner[2];
     first.start(loop, [&] {
         second.start(loop, [&] {
-            for (readable &each : inner)
+            for (watched &each : inner)
                 each.start(loop, [&] { escape(); });
             EXPECT_EQ(once() + once(), "escapedescaped");
         });
@@ -109,40 +102,39 @@ TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
 // ready meanwhile.
 TEST_F(Loop, WaitsNestToAnyDepth) {
     constexpr int depth = 50;
-    std::vector<readable> events(depth);
-    readable twice;
+    std::vector<watched> events(depth);
+    watched twice, later, due;
     int inside = 0, deepest = 0;
-    timer later, due; // one is not waited for
-    later.start(loop, 5000);
+    later.start_timer(loop, 5000); // not waited for
     twice.start(loop);
     EXPECT_EQ(once(), "ran");
-    for (readable &each : events)
+    for (watched &each : events)
         each.start(loop, [&] {
             deepest = std::max(deepest, ++inside);
             if (deepest == depth && !due.event)
-                due.start(loop, 20, [&] { twice.fill(); });
+                due.start_timer(loop, 20, [&] { twice.fill(); });
             while (deepest < depth || twice.runs < 2)
                 ASSERT_EQ(once(), "ran");
             inside--;
         });
     EXPECT_EQ(once(), "ran");
     EXPECT_TRUE(deepest == depth && later.runs == 0);
-    for (readable &each : events)
+    for (watched &each : events)
         EXPECT_EQ(each.runs, 1);
 }
 
 // Two events are ready in one round. The one that runs first removes the other, in each possible way.
 TEST_F(Loop, AnEventRemovedByAnEarlierCallbackNeverRuns) {
     for (int way = 0; way < 3; way++) {
-        readable pair[2];
+        watched pair[2];
         const auto remove_other = [&, way](int other) {
             if (way == 1)
                 return loop_event_free(&pair[other].event);
             loop_event_remove(pair[other].event);
             if (way == 0)
                 return;
-            timer nested; // freed by a callback of a nested round
-            nested.start(loop, 0, [&, other] { loop_event_free(&pair[other].event); });
+            watched nested; // freed by a callback of a nested round
+            nested.start_timer(loop, 0, [&, other] { loop_event_free(&pair[other].event); });
             EXPECT_EQ(once(), "ran");
         };
         pair[0].start(loop, [&] { remove_other(1); });
@@ -157,8 +149,8 @@ TEST_F(Loop, PostedWorkComesBeforeTheNextCallback) {
     carried = 0;
     loop_post work = {};
     work.function = [](loop_post *, int carry_out) { carried += carry_out; };
-    readable pair[2];
-    for (readable &each : pair)
+    watched pair[2];
+    for (watched &each : pair)
         each.start(loop, [&] {
             if (pair[0].runs + pair[1].runs == 1)
                 std::thread([&] { loop_post_work(loop, &work); }).join();
@@ -203,8 +195,7 @@ TEST_F(Signals, AreCallbacksInTheLoop) {
         EXPECT_TRUE(lew_event_delete(wrapper, &slots[0]) == LC_OK && !slots[0]);
     EXPECT_TRUE(!le_signal_contexts[SIGUSR1] && le_signal_contexts[SIGUSR2] == loop);
     raise(SIGUSR2);
-    EXPECT_EQ(once(), "ran");
-    EXPECT_TRUE(lew_delete_all_events(wrapper) == LC_OK && !slots[1]);
+    EXPECT_TRUE(once() == "ran" && lew_delete_all_events(wrapper) == LC_OK && !slots[1]);
     EXPECT_EQ(whole(), "no events");
 }
 

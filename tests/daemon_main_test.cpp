@@ -17,9 +17,7 @@ namespace {
 
 constexpr const char *PID_FILE = "/var/run/wccpd.pid";
 
-struct DaemonMain : daemon_test {
-    void TearDown() override { unlink(PID_FILE); }
-};
+using DaemonMain = daemon_test;
 
 TEST_F(DaemonMain, ThePidFile) {
     std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
@@ -30,6 +28,7 @@ TEST_F(DaemonMain, ThePidFile) {
     ASSERT_TRUE(symlink("/tmp/precious", PID_FILE) == 0 && wccpd_pid_init() == LC_BAD_FILE);
     EXPECT_EQ(said("Writing /var/run/wccpd.pid: Too many levels of symbolic links"), 1);
     EXPECT_EQ(text_of_file("/tmp/precious"), "kept");
+    unlink(PID_FILE);
 }
 
 TEST_F(DaemonMain, EncapsulationRanges) {

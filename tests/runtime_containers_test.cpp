@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <atomic>
 #include <numeric>
 #include <random>
 
@@ -45,9 +44,8 @@ TEST(Arrays, WalksAreSteered) {
         return value == 2 ? counted->second : LC_OK;
     };
     for (const auto &each : cases) {
-        calls counted = {0, each.second};
-        EXPECT_TRUE(uint32_array_foreach(list, steer, &counted) == each.result &&
-                    counted.first == each.calls);
+        calls got = {0, each.second};
+        EXPECT_TRUE(uint32_array_foreach(list, steer, &got) == each.result && got.first == each.calls);
         const std::string lines = log.take();
         EXPECT_TRUE(*each.line ? lines.find(each.line) != std::string::npos : lines.empty()) << lines;
     }
@@ -171,29 +169,6 @@ TEST(Arrays, AgreeWithAModel) {
     EXPECT_LT(compared, 10 * store.size());
 }
 
-// --- Memory that runs out
-
-#ifndef WCCP_SANITIZED
-int failing_calloc; // counts down to the call that fails
-} // namespace
-extern "C" void *__libc_calloc(size_t count, size_t size);
-extern "C" void *calloc(size_t count, size_t size) {
-    return failing_calloc > 0 && --failing_calloc == 0 ? nullptr : __libc_calloc(count, size);
-}
-namespace {
-TEST(Memory, EachAllocationFailsWithTheSameLine) {
-    log_lines log;
-    for (const int call : {1, 2}) {
-        array_owner list;
-        table_owner table;
-        failing_calloc = call;
-        EXPECT_TRUE(array_new(&list, nullptr) == LC_NULL && log.say("array_new(), array.cpp:"));
-        failing_calloc = call;
-        EXPECT_TRUE(ht_new(&table, nullptr) == LC_NULL && log.say("ht_new(), hash_table.cpp:"));
-    }
-}
-#endif
-
 // --- Hash table
 
 TEST(Hash, IsThePublishedOne) {
@@ -236,8 +211,7 @@ TEST_F(HashTable, GrowsAndShrinks) {
         ASSERT_TRUE(ht_lookup(table, &key, sizeof key, nullptr, nullptr, nullptr, &value) == LC_OK &&
                     value == &key);
     }
-    EXPECT_TRUE(ht_empty(table) == LC_OK && table->bucket_count == 31 &&
-                freed == 74 + 2000); // shrinks in one go
+    EXPECT_TRUE(ht_empty(table) == LC_OK && table->bucket_count == 31 && freed == 74 + 2000);
 }
 
 TEST_F(HashTable, DuplicatesMissesAndFailingFrees) {
@@ -258,3 +232,24 @@ TEST_F(HashTable, DuplicatesMissesAndFailingFrees) {
 }
 
 } // namespace
+
+// --- Memory that runs out
+
+#ifndef WCCP_SANITIZED
+static int failing_calloc; // counts down to the call that fails
+extern "C" void *__libc_calloc(size_t count, size_t size);
+extern "C" void *calloc(size_t count, size_t size) {
+    return failing_calloc > 0 && --failing_calloc == 0 ? nullptr : __libc_calloc(count, size);
+}
+TEST(Memory, EachAllocationFailsWithTheSameLine) {
+    log_lines log;
+    for (const int call : {1, 2}) {
+        array_owner list;
+        table_owner table;
+        failing_calloc = call;
+        EXPECT_TRUE(array_new(&list, nullptr) == LC_NULL && log.say("array_new(), array.cpp:"));
+        failing_calloc = call;
+        EXPECT_TRUE(ht_new(&table, nullptr) == LC_NULL && log.say("ht_new(), hash_table.cpp:"));
+    }
+}
+#endif

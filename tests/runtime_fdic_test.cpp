@@ -1,10 +1,5 @@
 // Interest lists and the bridge that carries their changes into the loop.
-#include <functional>
-#include <vector>
-
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "runtime/event_fdintrcb.h"
 #include "tests/support/gcl_log.h"

@@ -4,7 +4,6 @@
 #include <filesystem>
 #include <regex>
 
-#include <sys/stat.h>
 #include <syslog.h>
 
 #include "runtime/logging_levels.h"
@@ -184,8 +183,7 @@ TEST_F(Log, UnmanagedProcessesFollowTheFiles) {
         ASSERT_EQ(utimensat(AT_FDCWD, ZONE, later, 0), 0);
         usleep(1100000); // the files are checked once a second
         LC_LOG(LC_LOG_ERR, "two");
-        EXPECT_EQ(G_log_level, polls ? 6 : 4);
-        EXPECT_EQ(getenv("TZ") == nullptr, polls);
+        EXPECT_TRUE(G_log_level == polls ? 6 : 4 && !getenv("TZ") == polls);
     }
     unsetenv("TZ");
     unlink(ZONE);

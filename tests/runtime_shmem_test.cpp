@@ -5,33 +5,22 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <atomic>
 #include <filesystem>
 #include <fstream>
-#include <functional>
 
 #include <csignal>
 #include <sched.h>
 #include <sys/mman.h>
 #include <sys/shm.h>
-#include <sys/wait.h>
 
 #include "runtime/csys.h"
 #include "runtime/logging.h"
 #include "tests/support/log_daemon.h"
-
-namespace {
-
-constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
-constexpr key_t BLOCK_KEY = 0x12345;
-constexpr size_t REGISTRY_BYTES = 361608;
+#include "tests/support/test_host.h"
 
 // Replaces sleep(): nothing waits here, and a case may change something in the meantime.
-unsigned slept;
-std::function<void()> while_asleep;
-
-} // namespace
-
+static unsigned slept;
+static std::function<void()> while_asleep;
 extern "C" unsigned sleep(unsigned seconds) {
     slept += seconds;
     if (while_asleep)
@@ -41,20 +30,18 @@ extern "C" unsigned sleep(unsigned seconds) {
 
 namespace {
 
+constexpr uint64_t BLOCK_BYTES = 10000; // 12288 in pages
+constexpr key_t BLOCK_KEY = 0x12345;
+constexpr size_t REGISTRY_BYTES = 361608;
+
 // Runs `body` in a child process and returns its wait status: 0 if nothing failed.
 int in_process(bool own_keys, const std::function<void()> &body) {
-    fflush(nullptr);
-    const pid_t child = fork();
-    if (child == 0) {
+    return wait_for_child(start_child([&] {
         if (own_keys && unshare(CLONE_NEWIPC) != 0)
-            _exit(99);
+            return 99;
         body();
-        fflush(nullptr);
-        _exit(testing::Test::HasFailure());
-    }
-    int status = -1;
-    (void)waitpid(child, &status, 0);
-    return status;
+        return static_cast<int>(testing::Test::HasFailure());
+    }));
 }
 
 #define IN_CHILD(...) ASSERT_EQ(in_process(true, [&]() __VA_ARGS__), 0)
@@ -117,8 +104,8 @@ TEST_F(Blocks, ANewBlockIsFoundByOthersAndInTheRegistry) {
         const std::string pid = std::to_string(getpid());
         EXPECT_TRUE(logged("cmem_create_block: double create attempt for memory block block, old pid=" + pid +
                            ", new pid=" + pid + "\n"));
-        EXPECT_EQ(cmem_attach_block("nobody"), nullptr);
-        EXPECT_TRUE(logged("cmem_attach_block: memory block nobody not found\n"));
+        EXPECT_TRUE(!cmem_attach_block("nobody") &&
+                    logged("cmem_attach_block: memory block nobody not found\n"));
 
         EXPECT_EQ(segment_of(CMEM_REGISTRY_KEY).shm_segsz, REGISTRY_BYTES);
         const uint8_t *bytes = registry_bytes();
@@ -143,16 +130,15 @@ TEST_F(Blocks, TheNextProcessTakesOverABlock) {
         EXPECT_EQ(std::count(block, block + 12288, 0), 12288);
     });
     IN_CHILD({ // from a zombie, and from an earlier process with our process id
-        const pid_t gone = fork();
-        if (gone == 0)
-            _exit(create_block(BLOCK_BYTES, "block") && create_block(1, "other") ? 0 : 1);
+        const pid_t gone = start_child(
+            [] { return create_block(BLOCK_BYTES, "block") && create_block(1, "other") ? 0 : 1; });
         siginfo_t info;
         ASSERT_EQ(waitid(P_PID, static_cast<id_t>(gone), &info, WEXITED | WNOWAIT), 0);
         EXPECT_NE(create_block(BLOCK_BYTES, "block"), nullptr);
         const int32_t pid = getpid();
         memcpy(registry_bytes() + 168 + 112, &pid, sizeof pid);
         EXPECT_TRUE(create_block(1, "other") && !create_block(1, "other")); // now it is ours
-        (void)waitpid(gone, nullptr, 0);
+        (void)wait_for_child(gone);
     });
 }
 
@@ -173,12 +159,12 @@ TEST_F(Blocks, OfTwoProcessesExactlyOneCreatesABlock) {
         for (int round = 0; round < ROUNDS; round++) {
             counts[0] = counts[1] = counts[2] = 0;
             for (int process = 0; process < 2; process++)
-                if (fork() == 0) {
+                start_child([&] {
                     meet(&counts[0]);
                     counts[1] += create_block(BLOCK_BYTES, "block") != nullptr;
                     meet(&counts[2]);
-                    _exit(0);
-                }
+                    return 0;
+                });
             while (wait(nullptr) > 0)
                 continue;
             wrong += counts[1] != 1;
@@ -229,8 +215,7 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         EXPECT_TRUE(logged("cannot attach/shmget shared block block"));
         // The segment of a block in the registry has been replaced by a shorter one.
         ASSERT_NE(create_block(BLOCK_BYTES, "other"), nullptr);
-        ASSERT_EQ(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr), 0);
-        EXPECT_EQ(cmem_exists_block("other"), 0);
+        EXPECT_TRUE(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr) == 0 && cmem_exists_block("other") == 0);
         EXPECT_TRUE(logged("cannot shmget to shared block other, err=No such file or directory\n"));
         ASSERT_GE(shmget(0x12346, 4096, IPC_CREAT | 0777), 0);
         EXPECT_EQ(cmem_attach_block("other"), nullptr);
@@ -266,7 +251,7 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
         EXPECT_EQ(lines,
                   "error parsing affinity at line bad 12 normal 1\nerror parsing affinity at line bad\n"
                   "error parsing page size at line worse inter enormous 1\nerror parsing affinity at line " +
-                      std::string(255, 'b') + "\n");
+                      std::string(255, 'b'));
         for (const std::string name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
             EXPECT_EQ(create_block(1, name.c_str()), nullptr);
             EXPECT_TRUE(logged("attempt to create shared block " + name + " conflicts with conf file\n"));

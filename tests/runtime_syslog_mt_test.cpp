@@ -5,12 +5,10 @@
 #include <atomic>
 #include <thread>
 
-#include <pthread.h>
-#include <sys/wait.h>
-
 #include "runtime/logging.h"
 #include "runtime/ttime.h"
 #include "tests/support/log_daemon.h"
+#include "tests/support/test_host.h"
 
 namespace {
 
@@ -164,14 +162,12 @@ TEST_P(Syslog, AForkedChildCanLog) {
                 from_children += line.find("a child") != std::string::npos;
     });
     for (int round = 0; round < 30; round++) {
-        const pid_t child = fork();
-        if (child == 0) {
+        const pid_t child = start_child([] {
             alarm(5);
             QV_LOG(LC_LOG_NOTICE, "a child");
-            _exit(0);
-        }
-        int status = 0;
-        EXPECT_TRUE(waitpid(child, &status, 0) == child && status == 0); // and not the alarm
+            return 0;
+        });
+        EXPECT_EQ(wait_for_child(child), 0); // and not the alarm
     }
     for (int i = 0; i < 100 && from_children < 30; i++)
         usleep(10000);

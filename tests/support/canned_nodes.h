@@ -2,11 +2,20 @@
 #pragma once
 
 #include <cstring>
-#include <string>
-#include <vector>
+#include <sstream>
 
 #include "peers/mgmtctl/session.h"
 #include "runtime/common.h"
+
+// Bindings from "NAME TYPE VALUE|NAME TYPE VALUE|" and so on. A "%" at the beginning of a name stands for
+// `root`.
+inline std::vector<ctl_binding> bindings_of(const std::string &root, const std::string &text) {
+    std::vector<ctl_binding> out;
+    std::istringstream in(text);
+    for (ctl_binding one; in >> one.name >> one.type && std::getline(in.ignore(), one.value, '|');)
+        out.push_back({one.name[0] == '%' ? root + one.name.substr(1) : one.name, one.type, one.value});
+    return out;
+}
 
 struct canned_nodes {
     std::vector<ctl_binding> nodes;
