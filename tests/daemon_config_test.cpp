@@ -80,8 +80,7 @@ TEST_F(DaemonConfig, AGroupIsBuiltFromItsWholeSubtree) {
     EXPECT_EQ(said("WCCP config query group 51(51) - /qv/wccpd/wccp/srv_grp/config/51"), 2);
     EXPECT_EQ(said("WCCP config: set router ip to 10.0.0.201, position 0"), 2);
     EXPECT_EQ(said("WCCP config: set compatibility mode to nexus(2)"), 2);
-    EXPECT_EQ(said("twelve"), 0);
-    EXPECT_EQ(said("FAILED to create WCCP group 51"), 1);
+    EXPECT_TRUE(said("twelve") == 0 && said("FAILED to create WCCP group 51") == 1);
 }
 
 // Each node changes its own field or, if a running group cannot follow it, none.
@@ -128,26 +127,24 @@ TEST_F(DaemonConfig, ProtocolsByNameAndNumber) {
 }
 
 TEST_F(DaemonConfig, WordsAreComparedExactly) {
-    const std::tuple<int, const char *, uint32_t wccp_grp_config::*, uint32_t, uint32_t, const char *>
-        cases[] = {
-            {1, "UP", &wccp_grp_config::admin, 77, 0, "Invalid admin: UP, ignoring"},
-            {5, "either", &wccp_grp_config::fwd_method, 3, 0x10, "set encap either to 3"},
-            {5, "GRE", &wccp_grp_config::fwd_method, 3, 0x10, "Invalid forwarding method: GRE, using EITHER"},
-            {11, "h", &wccp_grp_config::assign_method, 3, 0x40, "Invalid assignment method: h, using EITHER"},
-            {21, "Ios", &wccp_grp_config::compatibility, 1, 0x80,
-             "Invalid compatibility mode: Ios, using ios"},
-            {12, "x", &wccp_grp_config::admin, 77, 0, "node type 12 unknown"},
-        };
+    using group = wccp_grp_config;
     wccp_grp_config config = {};
     take_node(&config, GROUP_NODE_INTERFACE, bn_type_str, "sixteen letters.");
     EXPECT_TRUE(config.interface == std::string("sixteen letters") && config.interface_set == 1);
-    for (const auto &[kind, text, field, value, flags, line] : cases) {
+    const auto check = [&](int kind, const char *text, uint32_t group::*field, uint32_t value, uint32_t flags,
+                           const std::string &line) {
         config = {};
         config.*field = 77;
         take_node(&config, kind, bn_type_str, text);
         EXPECT_TRUE(config.*field == value && config.config_flags == flags) << text;
-        EXPECT_EQ(said(std::string("WCCP config: ") + line), 1) << line;
-    }
+        EXPECT_EQ(said("WCCP config: " + line), 1) << line;
+    };
+    check(1, "UP", &group::admin, 77, 0, "Invalid admin: UP, ignoring");
+    check(5, "either", &group::fwd_method, 3, 0x10, "set encap either to 3");
+    check(5, "GRE", &group::fwd_method, 3, 0x10, "Invalid forwarding method: GRE, using EITHER");
+    check(11, "h", &group::assign_method, 3, 0x40, "Invalid assignment method: h, using EITHER");
+    check(21, "Ios", &group::compatibility, 1, 0x80, "Invalid compatibility mode: Ios, using ios");
+    check(12, "x", &group::admin, 77, 0, "node type 12 unknown");
 }
 
 TEST_F(DaemonConfig, RoutersInTheOrderOfTheirNumbersWithoutAGap) {
@@ -229,8 +226,7 @@ TEST_F(DaemonConfig, DeletedGroups) {
     binding_list list;
     list.add(CONFIG + "51/router/1", bn_type_uint8, "1", bn_flag_deleted)
         .add(CONFIG + "51/router/1/ipaddr", bn_type_ipv4addr, "10.0.0.1", bn_flag_deleted);
-    EXPECT_EQ(apply(list), LC_OK);
-    EXPECT_EQ(wccp_find_group(51), nullptr);
+    EXPECT_TRUE(apply(list) == LC_OK && !wccp_find_group(51));
     EXPECT_TRUE(said("update: Deleted Group 51") == 2 && said("update: Failed to delete Group 51") == 2);
 
     // Only the low eight bits of a number count.
@@ -263,8 +259,7 @@ TEST_F(DaemonConfig, PolicyMembership) {
     EXPECT_EQ(members(), "6:72 300:71 ");
     delete_root("71");
     EXPECT_EQ(change(CONFIG + "72/weight", bn_type_uint32, "1", bn_flag_deleted), LC_OK);
-    EXPECT_EQ(wccp_find_group(72), nullptr);
-    EXPECT_EQ(members(), "6:72 ");
+    EXPECT_TRUE(!wccp_find_group(72) && members() == "6:72 ");
     delete_root("72");
     EXPECT_EQ(members(), "");
 }
@@ -297,8 +292,7 @@ TEST_F(DaemonConfig, ChangesOfTheStartAreAppliedAfterIt) {
     EXPECT_EQ(group->weight, 0);
     apply_early_changes();
     ASSERT_TRUE(wccp_find_group(51) == group && group->weight == 8);
-    EXPECT_TRUE(!wccp_find_group(52) && !wccp_find_group(53) && wccp_find_group(54));
-    EXPECT_EQ(said("<139>"), 0);
+    EXPECT_TRUE(!wccp_find_group(52) && !wccp_find_group(53) && wccp_find_group(54) && said("<139>") == 0);
 
     keep_one("54/router/1/ipaddr", bn_type_ipv4addr, "10.0.0.9", bn_flag_deleted);
     apply_early_changes();

@@ -92,16 +92,23 @@ struct scripted_run {
     }
     // Every query has an empty answer, except that for the system mode.
     void answer(const wire &frame) {
-        static const char *const mode = "/qv/tunneld/system/config/mode";
+        owned_tbuffer bytes;
+        owned_request request;
         owned_response msg;
-        const auto request = static_cast<uint16_t>(number_at(frame, 26, 2)),
-                   type = bn_request_msg_response_msg_type(request);
-        ASSERT_EQ(bn_response_msg_create(&msg.pointer, type, number_at(frame, 40), 0, ""), LC_OK);
-        if (frame.find(mode) != wire::npos && type == bn_msg_query_response) {
+        ASSERT_EQ(tb_new_buf(&bytes.pointer, frame.data(), static_cast<int32_t>(frame.size())), LC_OK);
+        ASSERT_EQ(bn_request_msg_deserialize(bytes.pointer, BN_FRAME_HEADER_BYTES, &request.pointer), LC_OK);
+        const uint16_t type = bn_request_msg_response_msg_type(request.pointer->msg_type);
+        ASSERT_EQ(bn_response_msg_create(&msg.pointer, type, request.pointer->msg_id, 0, ""), LC_OK);
+        const bn_request_node *node = bn_request_per_node_array_get_quick(request.pointer->nodes, 0);
+        const char *mode = "/qv/tunneld/system/config/mode";
+        if (type == bn_msg_query_response && node &&
+            strcmp(bn_binding_get_name_quick(node->binding), mode) == 0) {
             owned_binding binding;
             ASSERT_EQ(bn_binding_new_str(&binding.pointer, mode, bn_attrib_value, bn_type_str, 0, "router"),
                       LC_OK);
-            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding.pointer, 1), LC_OK);
+            ASSERT_EQ(
+                bn_query_response_msg_append_binding_takeover(msg.pointer, &binding.pointer, node->node_id),
+                LC_OK);
         }
         put_message<bn_response_msg_serialize>(msg.pointer);
     }

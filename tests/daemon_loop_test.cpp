@@ -70,8 +70,7 @@ TEST_F(Loop, EndsWhenNothingIsRegistered) {
     watched only; // after it has fired, no event is left
     only.start_timer(loop, 30);
     const int64_t start = lt_monotonic_ms();
-    EXPECT_EQ(whole(), "no events");
-    EXPECT_TRUE(only.runs == 1 && lt_monotonic_ms() - start >= 25);
+    EXPECT_TRUE(whole() == "no events" && only.runs == 1 && lt_monotonic_ms() - start >= 25);
     watched gone; // closed: reported as ready, and removes itself
     gone.start(loop, [&] { loop_event_free(&gone.event); });
     close(gone.ends[0]);
@@ -117,8 +116,7 @@ TEST_F(Loop, WaitsNestToAnyDepth) {
                 ASSERT_EQ(once(), "ran");
             inside--;
         });
-    EXPECT_EQ(once(), "ran");
-    EXPECT_TRUE(deepest == depth && later.runs == 0);
+    EXPECT_TRUE(once() == "ran" && deepest == depth && later.runs == 0);
     for (watched &each : events)
         EXPECT_EQ(each.runs, 1);
 }

@@ -21,8 +21,7 @@ using DaemonMain = daemon_test;
 
 TEST_F(DaemonMain, ThePidFile) {
     std::ofstream(PID_FILE) << "an earlier text that is longer than any number";
-    EXPECT_EQ(wccpd_pid_init(), LC_OK);
-    EXPECT_EQ(text_of_file(PID_FILE), std::to_string(getpid()) + "\n");
+    EXPECT_TRUE(wccpd_pid_init() == LC_OK && text_of_file(PID_FILE) == std::to_string(getpid()) + "\n");
     unlink(PID_FILE);
     std::ofstream("/tmp/precious") << "kept";
     ASSERT_TRUE(symlink("/tmp/precious", PID_FILE) == 0 && wccpd_pid_init() == LC_BAD_FILE);

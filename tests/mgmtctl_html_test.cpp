@@ -9,7 +9,6 @@
 
 #include "peers/mgmtctl/html_file.h"
 #include "peers/mgmtctl/show_draw.h"
-#include "peers/mgmtctl/show_texts.h"
 #include "tests/support/texts.h"
 
 namespace {
@@ -141,8 +140,7 @@ TEST(Html, GroupsThatNeedAttentionAreUnfoldedAndFirst) {
     snapshot shown = good_snapshot(
         {good_group(1), good_group(2), good_group(3), good_group(4), good_group(5), good_group(6)});
     std::string page = draw_page(shown, ORIGIN);
-    EXPECT_TRUE(contains(page, "<h1>Nothing needs attention</h1>"));
-    EXPECT_EQ(count_of(page, "<details>"), 6u);
+    EXPECT_TRUE(contains(page, "<h1>Nothing needs attention</h1>") && count_of(page, "<details>") == 6);
 
     shown.groups[1].reasons.push_back({"password-mismatch", "10.0.0.1", "", "", "", 4, 70000, 3000});
     shown.groups[3].tables[0].owners[40] = 1;
@@ -180,26 +178,6 @@ TEST(Html, ATableIsComparedBucketByBucket) {
     for (int id = 0; id < 256; id++)
         all.push_back(good_group(id, 32, 8));
     EXPECT_LT(draw_page(good_snapshot(all), ORIGIN).size(), 6u << 20);
-}
-
-// tests/scenario_page.sh has that of hash buckets.
-TEST(Html, TheWantedTableOfMasksIsReadFromTheAssignmentText) {
-    std::string text = "\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
-                       "\t         0 : 0x00000003 0x00000000 0x0000   0x0000\n";
-    for (const char *row : {"0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.101",
-                            "1 : 0x00000001 0x00000000 0x0000   0x0000   10.0.0.102",
-                            "2 : 0x00000002 0x00000000 0x0000   0x0000   0.0.0.0",
-                            "3 : 0x00000003 0x00000000 0x0000   0x0000   10.0.0.101"})
-        text += std::string("\t         ") + row + "\n";
-    snapshot_group group;
-    take_assignment_text(text + "\tReceived router allocation\n\tRouter id                  : 10.0.0.1\n"
-                                "\tAppliance ip               : 10.0.0.102\n"
-                                "\tRxed value buckets (0-127) : 0x00000002 00000000 00000000 00000000\n",
-                         &group);
-    EXPECT_TRUE(group.wanted.mask);
-    EXPECT_EQ(group.wanted.owners, (std::vector<int>{0, 1, -1, 0}));
-    ASSERT_EQ(group.tables.size(), 1u);
-    EXPECT_EQ(group.tables[0].owners, (std::vector<int>{-1, 1, -1, -1})) << "as many values as are wanted";
 }
 
 TEST(Html, AFileIsReplacedAsAWholeOrNotAtAll) {

@@ -61,8 +61,7 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
         EXPECT_TRUE(contains(modern, "\n" + std::string(line) + "\n"));
     EXPECT_TRUE(lacks(modern, "pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\"",
                       "interface=\"a\""));
-    EXPECT_TRUE(contains(modern, "source=\"a\\\"b"));
-    EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
+    EXPECT_TRUE(contains(modern, "source=\"a\\\"b") && modern.ends_with("\n# EOF\n"));
     EXPECT_TRUE(contains(metrics_of(answered_by(known)), "# TYPE wccp_group_rx_icus_total counter\n"));
     EXPECT_TRUE(contains(metrics_of(answered_by({})), "wccp_daemon_up{daemon=\"wccpd\"} 0\n"));
     const auto silent = [](ctl_walk, const std::vector<std::string> &, ctl_reply *) { return false; };

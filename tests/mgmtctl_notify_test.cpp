@@ -192,8 +192,7 @@ TEST_F(Commands, EndWithTheirWholeGroupWhenTheyTakeTooLong) {
         usleep(10000);
     kill(pid, SIGTERM);
     pollfd ended = {pidfd, POLLIN, 0};
-    EXPECT_EQ(poll(&ended, 1, 8000), 1);
-    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    ASSERT_TRUE(poll(&ended, 1, 8000) == 1 && waitpid(pid, &status, 0) == pid);
     EXPECT_TRUE(WEXITSTATUS(status) != NOTIFY_DONE && !alive("slow") && read("next") == "");
     close(pidfd);
 }

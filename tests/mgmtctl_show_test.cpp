@@ -128,13 +128,10 @@ TEST(Show, TellsTheWholeOfAGroup) {
     EXPECT_EQ(
         (json{router["address"], router["assign"], router["shares"]["10.0.0.102"], self["asked_percent"],
               self["share_percent"], self["share_percent_most"], group["tables"].size(),
-              table["routers"].size(), all["alarms"][0]["group"], all["version"]})
+              table["routers"].size(), all["alarms"][0]["group"], all["version"], table["buckets"]})
             .dump(),
-        R"(["10.0.0.1",null,75,30,20,25,1,2,51,"1.0.0"])");
-    EXPECT_EQ(
-        table["buckets"].dump(),
-        R"([{"appliance":"10.0.0.101","first":0,"last":63},{"appliance":"10.0.0.102","first":64,"last":255}])");
-
+        R"(["10.0.0.1",null,75,30,20,25,1,2,51,"1.0.0",[)"
+        R"({"appliance":"10.0.0.101","first":0,"last":63},{"appliance":"10.0.0.102","first":64,"last":255}]])");
     EXPECT_TRUE(
         contains(joined(draw_screen(shown, {80, 23, false, false, ""}), "\n"),
                  "wccpd Ready (1.0.0)   1 group: 1 active   1 alarm\n! group 51: 10.0.0.3 does not answer (7 "
@@ -157,8 +154,7 @@ TEST(Show, NothingOfATextReachesTheTerminalAsAControl) {
     canned_nodes from = one_group();
     for (ctl_binding &node : from.nodes)
         if (node.name.find("/state") != std::string::npos && !node.name.ends_with("/oper"))
-            node.value += "\033[2J\x9b"
-                          "1m\r\n";
+            node.value += "\033[2J\2331m\r\n";
     const snapshot shown = gather_canned(&from);
     for (const std::string &text : {screen_of(shown), joined(draw_lines(shown), "\n"), draw_json(shown)})
         for (const char c : text)
@@ -181,14 +177,13 @@ TEST(Show, IsEmptyAndSaysSoWhereverMgmtdGoes) {
 
 TEST(Show, ManyGroupsAreBoundedInWorkAndRoom) {
     canned_nodes from = many_groups();
-    snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
+    const snapshot_limits limits = {.detailed = 4, .listed = 23, .alarms = 23};
     std::vector<std::string> lines = draw_screen(gather_canned(&from, limits), {79, 23, true, true, ""});
     ASSERT_TRUE(from.asked <= 16u + 23u * 7 && lines.size() == 23);
     EXPECT_TRUE(contains(lines[1], "routers 31/31  share 3%"));
     EXPECT_TRUE(contains(lines.back(), "and 235 groups not shown"));
 
-    limits = {.queries = 300};
-    const snapshot detailed = gather_canned(&from, limits);
+    const snapshot detailed = gather_canned(&from, {.queries = 300});
     EXPECT_LE(from.asked, 300u + 70u);
     const json all = json::parse(draw_json(detailed));
     EXPECT_TRUE(all["groups_total"] == 256 && all["groups"].size() == 5);
@@ -219,52 +214,46 @@ std::string explanation_of(const snapshot &shown, int group, int exit, bool as_j
 
 // Each row breaks a group that works, or changes it.
 TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
-    const struct {
-        const char *nodes, *said; // what is set, and what explain prints, all of the first reason
-        int exit = 1;
-        const char *screen = "";
-    } rows[] = {
-        {"", "group 51  ACTIVE, designated\n  nothing needs attention\n", 0},
-        {"Q/code password-mismatch|Q/sender 10.0.0.1|",
-         "  password-mismatch: 10.0.0.1 signs its messages with another password\n"
-         "    4 times, first 0:01:10 ago, last 0:00:03 ago\n"
-         "    next: set the same one on both: mgmtctl group set 51 password -\n",
-         1, "51  ACTIVE, designated !"},
-        {"Q/code interface-missing|Q/wanted eth9|", "there is no interface eth9\n", 1,
-         "51  ACTIVE, designated, no interface !"},
-        {"Q/code election-blocked|Q/sender 10.0.0.9|Q/offered no I-See-You|Q/wanted two-way|",
-         "the routers list 10.0.0.9", 1,
-         "  no appliance can be designated: the routers list 10.0.0.9, which is not\n"
-         "    two-way here: no I-See-You, for 0:01:10\n"},
-        {"Q/code router-id-zero|Q/source 10.0.0.1|", "router-id-zero: 10.0.0.1 calls itself 0.0.0.0\n"},
-        {"Q/code query-refused|Q/sender 10.0.0.1|Q/offered a query|",
-         "  nothing needs attention\n  query-refused: ", 0},
-        {"Q/code method-differs|Q/sender 10.0.0.1|Q/offered hash by the router|Q/wanted mask|",
-         "assignment is hash by the router, but mask here"},
-        {"Q/code not-known-here|Q/sender 10.0.0.1|", "  not-known-here: not-known-here of 10.0.0.1\n"},
-        {"S/oper BACKUP|",
-         "redirected-elsewhere: this appliance gets nothing: the routers redirect to 10.0.0.102 75%"},
-        {"S/oper INIT|", "waiting-assignment: the routers answer; no table is in force yet (10.0.0.101 is"},
-        {"Q/code restart-needed|Q/offered forwarding by gre|Q/wanted L2|",
-         "restart-needed: the group runs with forwarding by gre, but is configured with L2\n"},
-        {"C/admin down|", "  nothing needs attention\n  disabled: the group is disabled\n", 0},
-    };
-    for (const auto &row : rows) {
-        SCOPED_TRACE(row.nodes);
+    // What is set, and what explain prints, all of the first reason.
+    const auto check = [](const std::string &nodes, const char *said, int exit = 1, const char *screen = "") {
+        SCOPED_TRACE(nodes);
         canned_nodes from = one_group("");
         std::erase_if(from.nodes, [](const auto &node) { return node.name.ends_with("/router/3/ipaddr"); });
-        if (*row.nodes == 'Q')
+        if (nodes[0] == 'Q')
             set_nodes(&from, "Q/source 0.0.0.0|Q/sender 0.0.0.0|Q/count 4|Q/first 70000|Q/last 3000|");
-        set_nodes(&from, row.nodes + std::string("P/name table|"));
+        set_nodes(&from, nodes + "P/name table|");
         const snapshot shown = gather_canned(&from);
-        EXPECT_TRUE(contains(explanation_of(shown, 51, row.exit), row.said));
-        EXPECT_TRUE(contains(screen_of(shown), row.screen));
+        EXPECT_TRUE(contains(explanation_of(shown, 51, exit), said));
+        EXPECT_TRUE(contains(screen_of(shown), screen));
         EXPECT_EQ(json::parse(draw_json(shown))["groups"][0]["tables"][0]["routers"].size(),
-                  strstr(row.nodes, "by the router") ? 1u : 2u); // such a table is misread
-        const json parsed = json::parse(explanation_of(shown, -1, row.exit, true));
+                  nodes.find("by the router") != std::string::npos ? 1u : 2u); // such a table is misread
+        const json parsed = json::parse(explanation_of(shown, -1, exit, true));
         for (const json &each : parsed["reasons"])
             EXPECT_TRUE(each["cause"] != "" && each["next"] != "") << each;
-    }
+    };
+    check("", "group 51  ACTIVE, designated\n  nothing needs attention\n", 0);
+    check("Q/code password-mismatch|Q/sender 10.0.0.1|",
+          "  password-mismatch: 10.0.0.1 signs its messages with another password\n"
+          "    4 times, first 0:01:10 ago, last 0:00:03 ago\n"
+          "    next: set the same one on both: mgmtctl group set 51 password -\n",
+          1, "51  ACTIVE, designated !");
+    check("Q/code interface-missing|Q/wanted eth9|", "there is no interface eth9\n", 1,
+          "51  ACTIVE, designated, no interface !");
+    check("Q/code election-blocked|Q/sender 10.0.0.9|Q/offered no I-See-You|Q/wanted two-way|",
+          "the routers list 10.0.0.9", 1,
+          "  no appliance can be designated: the routers list 10.0.0.9, which is not\n"
+          "    two-way here: no I-See-You, for 0:01:10\n");
+    check("Q/code router-id-zero|Q/source 10.0.0.1|", "router-id-zero: 10.0.0.1 calls itself 0.0.0.0\n");
+    check("Q/code query-refused|Q/offered a query|", "  nothing needs attention\n  query-refused: ", 0);
+    check("Q/code method-differs|Q/sender 10.0.0.1|Q/offered hash by the router|Q/wanted mask|",
+          "assignment is hash by the router, but mask here");
+    check("Q/code not-known-here|Q/sender 10.0.0.1|", "  not-known-here: not-known-here of 10.0.0.1\n");
+    check("S/oper BACKUP|",
+          "redirected-elsewhere: this appliance gets nothing: the routers redirect to 10.0.0.102 75%");
+    check("S/oper INIT|", "waiting-assignment: the routers answer; no table is in force yet (10.0.0.101 is");
+    check("Q/code restart-needed|Q/offered forwarding by gre|Q/wanted L2|",
+          "restart-needed: the group runs with forwarding by gre, but is configured with L2\n");
+    check("C/admin down|", "  nothing needs attention\n  disabled: the group is disabled\n", 0);
 }
 
 TEST(Show, AnAlarmHasTheReasonThatFitsIt) {
@@ -294,9 +283,7 @@ TEST(Show, WhatIsNotKnownIsNotSaid) {
     EXPECT_EQ(json::parse(explanation_of(gather_canned(&from), -1, 2, true))["reasons"][0]["reason"],
               "mgmtd-unreachable");
     from.lost_after = SIZE_MAX;
-    snapshot_limits other;
-    other.only = 52;
-    (void)explanation_of(gather_canned(&from, other), 52, 2, true);
+    (void)explanation_of(gather_canned(&from, {.only = 52}), 52, 2, true);
 }
 
 TEST(Show, EveryReasonHasWordsAndIsInTheDocuments) {
@@ -418,6 +405,19 @@ TEST(Show, AssignmentTextsAreReadTolerantly) {
     ASSERT_TRUE(group.tables.size() == 1 && group.tables[0].mask);
     // 13 values with an owner, of the 16 of four bits.
     EXPECT_EQ(group.tables[0].owners, (std::vector<int>{0, 0, 0, 0, 1, 1, 1, 1, 1, 1, 1, 1, 1, -1, -1, -1}));
+
+    // A wanted table tells how many values there are; tests/scenario_page.sh has that of hash buckets.
+    std::string wanted = "\tAppliance ip               : 10.0.0.101\n\tHash/mask allotment        : 50 % \n"
+                         "\t         0 : 0x00000003 0x00000000 0x0000   0x0000\n";
+    for (const std::string row : {"0 : 0x00000000 0x00000000 0x0000   0x0000   10.0.0.101",
+                                  "1 : 0x00000001 0x00000000 0x0000   0x0000   10.0.0.102",
+                                  "2 : 0x00000002 0x00000000 0x0000   0x0000   0.0.0.0",
+                                  "3 : 0x00000003 0x00000000 0x0000   0x0000   10.0.0.101"})
+        wanted += "\t         " + row + "\n";
+    snapshot_group four;
+    take_assignment_text(wanted + mask, &four);
+    EXPECT_TRUE(four.wanted.mask && four.wanted.owners == (std::vector<int>{0, 1, -1, 0}));
+    EXPECT_EQ(four.tables.at(0).owners, (std::vector<int>{0, 0, 0, 0}));
 
     const std::string whole = mask + hash_rows("10.0.0.2") + std::string(1000, '\t') + hash_rows("\033");
     for (size_t length = 0; length < whole.size(); length++) {

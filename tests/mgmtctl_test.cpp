@@ -18,34 +18,28 @@
 #include "tests/support/gcl_provider.h"
 #include "tests/support/texts.h"
 
-static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config";
-static const std::string G51 = GROUPS + "/51";
-static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
+static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config", G51 = GROUPS + "/51",
+                         STATES = "/qv/wccpd/wccp/srv_grp/state";
 
 // --- What is shown
 
 TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
-    const struct {
-        ctl_binding binding;
-        const char *json, *text;
-    } cases[] = {
-        {{"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n"},
-        {{"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n"},
-        {{"/a", "bool", "true"}, "true", "/a = true\n"},
-        {{"/a", "string", "7"}, "\"7\"", "/a = 7\n"},
-        {{"/a", "none", ""}, "null", "/a =\n"},
-        {{"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n"},
-        {{"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n"},
-        {{"/a/password", "string", ""}, "\"\"", "/a/password =\n"},
-        {{"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
-         "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
-         "/a/debug =\n    WCCP password  : ********\n    x: y\n     WCCP password : ********\n    WCCP "
-         "password\n"},
+    const auto check = [](const ctl_binding &binding, const std::string &json, const char *text) {
+        EXPECT_EQ(json_line(json_node(binding, false)["value"]), json + "\n");
+        EXPECT_EQ(text_node(binding, false), text);
     };
-    for (const auto &one : cases) {
-        EXPECT_EQ(json_line(json_node(one.binding, false)["value"]), std::string(one.json) + "\n");
-        EXPECT_EQ(text_node(one.binding, false), one.text);
-    }
+    check({"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n");
+    check({"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n");
+    check({"/a", "bool", "true"}, "true", "/a = true\n");
+    check({"/a", "string", "7"}, "\"7\"", "/a = 7\n");
+    check({"/a", "none", ""}, "null", "/a =\n");
+    check({"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n");
+    check({"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n");
+    check({"/a/password", "string", ""}, "\"\"", "/a/password =\n");
+    check({"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
+          "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
+          "/a/debug =\n    WCCP password  : ********\n    x: y\n     WCCP password : ********\n    WCCP "
+          "password\n");
 }
 
 TEST(Shown, AnEventIsALineAndAnObject) {
@@ -77,10 +71,9 @@ TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
                                                   "delete " + G51 + "/policy_grp (was 3)"}));
     const ctl_json told = json_event(change, true);
     EXPECT_EQ(told["changes"].items[0]["after"].text, "neu");
-    EXPECT_EQ(json_line(told["changes"].items[1]),
+    EXPECT_EQ(json_text(told["changes"].items[1]),
               "{\"name\":\"" + G51 +
-                  R"(/policy_grp","change":"delete","type":"uint32","before":3,"after":null})"
-                  "\n");
+                  R"(/policy_grp","change":"delete","type":"uint32","before":3,"after":null})");
 }
 
 TEST(Shown, JsonIsWrittenInAsciiAndReadToADepth) {
@@ -104,8 +97,9 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
         {G51, GROUPS + "/52"},
         bindings_of(G51, "%/priority uint32 10|%/protocol string tcp|%/policy_grp uint32 3|"
                          "%/weight uint32 100|%/router/1 uint8 1|")};
-    const auto check = [&](const char *changes, const strings &created, const char *note) { // a piece of it
-        std::vector<ctl_change_item> items; // NAME=VALUE, or NAME to remove it
+    const auto check = [&](const char *changes, const strings &created,
+                           const char *note) { // a piece of it
+        std::vector<ctl_change_item> items;    // NAME=VALUE, or NAME to remove it
         std::istringstream words(changes);
         for (std::string word; words >> word;) {
             const size_t end = std::min(word.find('='), word.size());
@@ -228,7 +222,7 @@ static canned_nodes sample_nodes() {
         "%/state/51/appliance/2/ipaddr ipv4addr 10.0.0.102|")};
 }
 
-TEST(Names, AreCompletedToTheirNextPart) {
+TEST(Names, AreCompletedToTheirNextPartAndAMistypedOneGetsAHint) {
     canned_nodes known = sample_nodes();
     const auto check = [&](const std::string &word, const std::string &found) {
         EXPECT_EQ(joined(complete_node_name(std::ref(known), word), " "), found);
@@ -240,10 +234,6 @@ TEST(Names, AreCompletedToTheirNextPart) {
     check("/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages");
     check(G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either");
     check("qv", "");
-}
-
-TEST(Names, AMistypedOneGetsAHint) {
-    canned_nodes known = sample_nodes();
     const ctl_ask ask = std::ref(known);
     EXPECT_EQ(hint_for_missing(ask, "qv/wccpd"), "a name begins with \"/\"");
     EXPECT_EQ(hint_for_missing(ask, "/qv//wccpd"), "a name has no empty part");
@@ -378,49 +368,44 @@ static std::string judge_host(const check_facts &host) {
 
 TEST(Check, EachFactIsJudged) {
     using enum check_feature;
-    const struct {
-        void (*change)(check_facts &host);
-        const char *found;
-    } rows[] = {
-        {[](auto &) {}, ""},
-        {[](auto &it) { it.sockets[1].address = "0.0.0.0"; }, "port-taken "},
-        {[](auto &it) { it.sockets[1].address = "10.0.0.101"; }, "port-taken "},
-        {[](auto &it) { it.sockets[0].program = ""; }, "-UDP port 2048 "},
-        {[](auto &it) { it.sockets[0].program = "", it.wccpd_runs = false; }, "port-taken -locked memory "},
-        {[](auto &it) { it.groups[2].up = true; }, "interface-missing@53 "},
-        {[](auto &it) { it.groups[0].interface = it.groups[1].interface = ""; },
-         "no-interface@51 no-interface@52 "},
-        {[](auto &it) { it.interfaces["eth0"].up = false; }, "interface-down@51 "},
-        {[](auto &it) { it.interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 "},
-        {[](auto &it) { it.all_rp_filter = 1; }, "rp-filter rp-filter@52 "},
-        {[](auto &it) { it.interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
-        {[](auto &it) { it.all_rp_filter = 2, it.interfaces["wccp0"].rp_filter = 1; }, ""},
-        {[](auto &it) { it.interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
-        {[](auto &it) { it.interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 "},
-        {[](auto &it) { it.interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
-        {[](auto &it) { it.gre = missing; }, "gre-by-tun "},
-        {[](auto &it) { it.gre = it.tun = missing; }, "gre-missing "},
-        {[](auto &it) { it.tproxy = missing, it.tun = unknown; }, "tproxy-missing -kernel "},
-        {[](auto &it) { it.clock_synchronised = false; }, "clock-unsynchronised "},
-        {[](auto &it) { it.may_lock = false; }, ""}, // there is no limit
-        {[](auto &it) { it.may_lock = false, it.lock_limit_bytes = 65536; }, "memory-lock "},
-        {[](auto &it) { it.mem_conf.error = ENOENT, it.mem_conf.complete = false; }, "mem-conf-unreadable "},
-        {[](auto &it) { it.mem_conf.bad_line = 3, it.mem_conf.complete = false; },
-         "mem-conf-line mem-conf-mailbox "},
-        {[](auto &it) { it.mem_conf.error = EACCES, it.root = false; }, "-mem.conf "},
-        {[](auto &it) { it.platform_conf.error = ENOENT; }, ""},
-        {[](auto &it) { it.platform_conf.bad_line = 1; }, "platform-conf-line "},
-        {[](auto &it) { it.filter_error = "no", it.legacy_tables = "filter"; }, "-firewall -firewall "},
-        {[](auto &it) { it.mgmtd_error = "gone", it.groups.clear(), it.all_rp_filter = 1; },
-         "rp-filter -interfaces -rp_filter -forwarding -MTU "},
-    };
-    for (const auto &row : rows) {
+    const auto check = [](void (*change)(check_facts &), const char *found) {
         check_facts host = sound_host();
-        row.change(host);
+        change(host);
         if (!host.mgmtd_error.empty())
             host.sockets.clear();
-        EXPECT_EQ(judge_host(host), row.found) << &row - rows;
-    }
+        EXPECT_EQ(judge_host(host), found);
+    };
+    check([](auto &) {}, "");
+    check([](auto &it) { it.sockets[1].address = "0.0.0.0"; }, "port-taken ");
+    check([](auto &it) { it.sockets[1].address = "10.0.0.101"; }, "port-taken ");
+    check([](auto &it) { it.sockets[0].program = ""; }, "-UDP port 2048 ");
+    check([](auto &it) { it.sockets[0].program = "", it.wccpd_runs = false; }, "port-taken -locked memory ");
+    check([](auto &it) { it.groups[2].up = true; }, "interface-missing@53 ");
+    check([](auto &it) { it.groups[0].interface = it.groups[1].interface = ""; },
+          "no-interface@51 no-interface@52 ");
+    check([](auto &it) { it.interfaces["eth0"].up = false; }, "interface-down@51 ");
+    check([](auto &it) { it.interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 ");
+    check([](auto &it) { it.all_rp_filter = 1; }, "rp-filter rp-filter@52 ");
+    check([](auto &it) { it.interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 ");
+    check([](auto &it) { it.all_rp_filter = 2, it.interfaces["wccp0"].rp_filter = 1; }, "");
+    check([](auto &it) { it.interfaces["wccp0"].forwarding = 0; }, "forwarding-off ");
+    check([](auto &it) { it.interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 ");
+    check([](auto &it) { it.interfaces["eth0"].mtu = 1499; }, "mtu-small@51 ");
+    check([](auto &it) { it.gre = missing; }, "gre-by-tun ");
+    check([](auto &it) { it.gre = it.tun = missing; }, "gre-missing ");
+    check([](auto &it) { it.tproxy = missing, it.tun = unknown; }, "tproxy-missing -kernel ");
+    check([](auto &it) { it.clock_synchronised = false; }, "clock-unsynchronised ");
+    check([](auto &it) { it.may_lock = false; }, ""); // there is no limit
+    check([](auto &it) { it.may_lock = false, it.lock_limit_bytes = 65536; }, "memory-lock ");
+    check([](auto &it) { it.mem_conf.error = ENOENT, it.mem_conf.complete = false; }, "mem-conf-unreadable ");
+    check([](auto &it) { it.mem_conf.bad_line = 3, it.mem_conf.complete = false; },
+          "mem-conf-line mem-conf-mailbox ");
+    check([](auto &it) { it.mem_conf.error = EACCES, it.root = false; }, "-mem.conf ");
+    check([](auto &it) { it.platform_conf.error = ENOENT; }, "");
+    check([](auto &it) { it.platform_conf.bad_line = 1; }, "platform-conf-line ");
+    check([](auto &it) { it.filter_error = "no", it.legacy_tables = "filter"; }, "-firewall -firewall ");
+    check([](auto &it) { it.mgmtd_error = "gone", it.groups.clear(), it.all_rp_filter = 1; },
+          "rp-filter -interfaces -rp_filter -forwarding -MTU ");
     const std::string documents = text_of_file(WCCP_SOURCE_DIR "/docs/operations.md");
     for (const reason_text &text : check_texts())
         EXPECT_TRUE(contains(documents, std::string("| `") + text.code + "` "));

@@ -135,8 +135,7 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
 }
 
 TEST_F(FdicBridge, TimersFireOnce) {
-    int32_t id = 0, soon = 0;
-    int none = 0;
+    int32_t id = 0, soon = 0, none = 0;
     ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, as_pointer(3), &id), LC_OK);
     expect_round("3:3 ");
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again

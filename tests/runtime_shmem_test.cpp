@@ -126,8 +126,7 @@ TEST_F(Blocks, TheNextProcessTakesOverABlock) {
         EXPECT_TRUE(logged("length change attempt for memory block block, old len=12288, new len=20480\n"));
         const int id = shmget(BLOCK_KEY, 0, 0);
         const uint8_t *block = create_block(BLOCK_BYTES + 1, "block");
-        ASSERT_TRUE(block && shmget(BLOCK_KEY, 0, 0) == id);
-        EXPECT_EQ(std::count(block, block + 12288, 0), 12288);
+        ASSERT_TRUE(block && shmget(BLOCK_KEY, 0, 0) == id && std::count(block, block + 12288, 0) == 12288);
     });
     IN_CHILD({ // from a zombie, and from an earlier process with our process id
         const pid_t gone = start_child(
@@ -205,8 +204,7 @@ TEST_F(Blocks, ARegistryThatIsNotReady) {
 
 TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
     IN_CHILD({
-        ASSERT_GE(shmget(BLOCK_KEY, 4096, IPC_CREAT | 0777), 0);
-        EXPECT_EQ(create_block(BLOCK_BYTES, "block"), nullptr);
+        ASSERT_TRUE(shmget(BLOCK_KEY, 4096, IPC_CREAT | 0777) >= 0 && !create_block(BLOCK_BYTES, "block"));
         EXPECT_TRUE(
             logged("cmem_create_block: cannot attach/shmget shared block block, length=12288, key=12345, "
                    "pagesize=4096, shmid=-1, err=Invalid argument, errno=22, check SHMMAX\n"));
@@ -217,8 +215,7 @@ TEST_F(Blocks, ABlockOfAnotherSizeIsRefused) {
         ASSERT_NE(create_block(BLOCK_BYTES, "other"), nullptr);
         EXPECT_TRUE(shmctl(shmget(0x12346, 0, 0), IPC_RMID, nullptr) == 0 && cmem_exists_block("other") == 0);
         EXPECT_TRUE(logged("cannot shmget to shared block other, err=No such file or directory\n"));
-        ASSERT_GE(shmget(0x12346, 4096, IPC_CREAT | 0777), 0);
-        EXPECT_EQ(cmem_attach_block("other"), nullptr);
+        ASSERT_TRUE(shmget(0x12346, 4096, IPC_CREAT | 0777) >= 0 && !cmem_attach_block("other"));
         EXPECT_TRUE(logged("cannot shmget shared block other, key=74566, err=Invalid argument\n"));
     });
     for (const size_t bytes : {size_t{8193}, size_t{BLOCK_BYTES}}) // enough in whole pages
@@ -248,10 +245,11 @@ TEST_F(Blocks, LinesOfTheConfiguration) {
         std::string lines;
         for (const std::string &line : daemon.take())
             lines += line.substr(std::min(line.find("error parsing"), line.size()));
-        EXPECT_EQ(lines,
-                  "error parsing affinity at line bad 12 normal 1\nerror parsing affinity at line bad\n"
-                  "error parsing page size at line worse inter enormous 1\nerror parsing affinity at line " +
-                      std::string(255, 'b'));
+        EXPECT_EQ(
+            lines,
+            "error parsing affinity at line bad 12 normal 1\n\nerror parsing affinity at line bad\n\n"
+            "error parsing page size at line worse inter enormous 1\n\nerror parsing affinity at line " +
+                std::string(255, 'b') + "\n\n");
         for (const std::string name : {"bad", "worse", "registry", "nokey", "big", "words", "unlisted"}) {
             EXPECT_EQ(create_block(1, name.c_str()), nullptr);
             EXPECT_TRUE(logged("attempt to create shared block " + name + " conflicts with conf file\n"));
@@ -285,8 +283,8 @@ TEST(DisplayBuffer, HoldsWhatFits) {
     char small[33];
     EXPECT_EQ(csys_create_safe_display_buf_desc(small, 32), nullptr);
     csys_display_buf *buffer = csys_create_safe_display_buf_desc(small, 33);
-    ASSERT_TRUE(buffer && csys_append_to_safe_display_buf(buffer, "x") == 0);
-    EXPECT_STREQ(csys_display_buf_text(buffer), "");
+    ASSERT_TRUE(buffer && csys_append_to_safe_display_buf(buffer, "x") == 0 &&
+                !*csys_display_buf_text(buffer));
 }
 
 } // namespace

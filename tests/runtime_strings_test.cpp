@@ -81,14 +81,7 @@ TEST(Strings, NullsTakeoverAndOrder) {
 
 // In memory of somebody else, strings and arrays of them take any operation and leave that memory alone.
 TEST(Strings, PackedInOneAllocation) {
-    static const std::pair<lc_status (*)(tstring *), const char *> changes[] = {
-        {[](tstring *string) { return ts_append_str(string, "cdefghijklmnopq"); }, "abcdefghijklmnopq"},
-        {[](tstring *string) { return ts_copy_str(string, 1, "c"); }, "ac"},
-        {[](tstring *string) { return ts_trim(string, 'a', 0); }, "b"},
-        {[](tstring *string) { return ts_set_utf8(string, 1); }, "ab"},
-        {ts_clear, ""},
-    };
-    for (const auto &[change, expected] : changes) {
+    const auto check = [](lc_status (*change)(tstring *), const char *expected) {
         tokens_owner array;
         tstring *records = nullptr, *one = nullptr;
         char *bytes = nullptr;
@@ -101,7 +94,12 @@ TEST(Strings, PackedInOneAllocation) {
         EXPECT_STREQ(tstr_array_get_str_quick(array, 1), "cd");
         ASSERT_EQ(tstr_array_remove(array, 0, &one), LC_OK);
         EXPECT_EQ(text_of([&](char **out) { return ts_detach(&one, out, nullptr); }), expected);
-    }
+    };
+    check([](tstring *string) { return ts_append_str(string, "cdefghijklmnopq"); }, "abcdefghijklmnopq");
+    check([](tstring *string) { return ts_copy_str(string, 1, "c"); }, "ac");
+    check([](tstring *string) { return ts_trim(string, 'a', 0); }, "b");
+    check([](tstring *string) { return ts_set_utf8(string, 1); }, "ab");
+    check(ts_clear, "");
 }
 
 TEST(Strings, CharactersOfUtf8) {

@@ -25,7 +25,10 @@ struct canned_nodes {
     uint32_t wccpd_code = 0;      // of its answers
 
     void add(const std::string &name, const std::string &value) { nodes.push_back({name, "string", value}); }
-    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
+    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out,
+                    std::string *out_reason = nullptr) {
+        if (out_reason)
+            *out_reason = "mgmtd closed the session";
         if (asked++ >= lost_after)
             return false;
         if (name.find("/state") != std::string::npos && name.starts_with("/qv/wccpd"))
@@ -44,9 +47,5 @@ struct canned_nodes {
         if (out->bindings.size() > most)
             *out = {LC_NO_BUFFER_SPACE, "ask for less", {}};
         return true;
-    }
-    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-        *out_reason = "mgmtd closed the session";
-        return (*this)(walk, name, out);
     }
 };
