@@ -107,7 +107,7 @@ TEST(LoopThreads, PostedWorkAndEscapesEndTheWaitAtEachDepth) {
         usleep(50000);
         const int64_t start = lt_monotonic_ms();
         counted_post::send(it.loop, 0, &expected);
-        while (ended < (nested ? 1 : 0))
+        for (int i = 0; ended < (nested ? 1 : 0) && i < 3000; i++)
             usleep(1000);
         usleep(20000);
         EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
