@@ -13,28 +13,24 @@
 #include "runtime/list.h"
 #include "tests/support/gcl_provider.h"
 #include "tests/support/owners.h"
+#include "tests/support/test_host.h"
 
 namespace {
 
 constexpr uint8_t FIRST_GROUP = 51, GROUPS = 3;
 
-// All changes of a group's alarms, in one hold of the engine lock.
-void raise_and_clear_alarms(wccp_service_group *group) {
-    const wccp_engine_lock lock;
-    wccp_alarm_raise_router_down_alarm(group);
-    wccp_alarms_verify_allocation_table(group); // its router redirects to no appliance
-    wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
-    wccp_alarms_clear_all_raised_alarms(group);
-}
-
-void *engine_thread(void *group) {
-    for (;;) {
-        raise_and_clear_alarms(static_cast<wccp_service_group *>(group));
-        usleep(100);
+// Makes all changes of a group's alarms, each time in one hold of the engine lock.
+void *engine_thread(void *data) {
+    for (auto *group = static_cast<wccp_service_group *>(data);; usleep(100)) {
+        const wccp_engine_lock lock;
+        wccp_alarm_raise_router_down_alarm(group);
+        wccp_alarms_verify_allocation_table(group); // its router redirects to no appliance
+        wccp_set_role_and_send_event(group->id, WCCP_ROLE_BACKUP);
+        wccp_alarms_clear_all_raised_alarms(group);
     }
 }
 
-// An event as "name: binding=text ...".
+// An event as "name binding=text ..."; "#" marks what is not a string.
 std::string text_of_event(const wire &frame) {
     owned_tbuffer bytes;
     owned_request event;
@@ -46,8 +42,8 @@ std::string text_of_event(const wire &frame) {
         const bn_binding *binding = bn_request_per_node_array_get_quick(event.pointer->nodes, i)->binding;
         uint32_t type = 0;
         EXPECT_EQ(bn_binding_get_type(binding, bn_attrib_value, &type, nullptr), LC_OK);
-        text += std::string(type == bn_type_str ? " " : " (number) ") + bn_binding_get_name_quick(binding) +
-                "=" + text_of([&](char **out) {
+        text += std::string(type == bn_type_str ? " " : " #") + bn_binding_get_name_quick(binding) + "=" +
+                text_of([&](char **out) {
                     return bn_binding_get_str(binding, bn_attrib_value, 0, nullptr, out);
                 });
     }
@@ -67,17 +63,14 @@ struct listening_provider {
             EXPECT_TRUE(provider.open_session());
             for (wire frame; !(frame = provider.take_frame()).empty();) {
                 events[text_of_event(frame)]++;
-                if (seen_often() && closes)
+                enough = std::count_if(events.begin(), events.end(),
+                                       [](auto &each) { return each.second > 20; }) == 5 * GROUPS;
+                if (enough && closes)
                     break;
             }
             provider.close_client();
             over = true;
         });
-    }
-    bool seen_often() {
-        enough = std::count_if(events.begin(), events.end(), [](auto &each) { return each.second > 20; }) ==
-                 5 * GROUPS;
-        return enough;
     }
     std::atomic<bool> enough = false, over = false;
 };
@@ -95,8 +88,7 @@ std::map<std::string, int> expected_events() {
         alarm("clear", "196638", "clearing adjacency down alarm");
         alarm("raise", "196639", "raising assignment table mismatch alarm");
         alarm("clear", "196639", "clearing assignment table alarm");
-        all["/qv/state/events/role_change (number) kind=1 group=" + number +
-            " (number) role=1 (number) code=237"]++;
+        all["/qv/state/events/role_change #kind=1 group=" + number + " #role=1 #code=237"]++;
     }
     return all;
 }
@@ -119,8 +111,7 @@ void live_and_end(bool session_is_lost) {
         cthread *thread = cthread_init("sender", engine_thread, &group, nullptr, nullptr, 0, 0, 0, 0);
         ASSERT_EQ(cthread_start(thread), 0);
     }
-    EXPECT_EQ(qv_alm_mgmt_init("wccpd"), LC_OK);
-    EXPECT_NE(qv_alm_mgmt_session.load(), nullptr);
+    EXPECT_TRUE(qv_alm_mgmt_init("wccpd") == LC_OK && qv_alm_mgmt_session.load());
     while (!(session_is_lost ? provider.over : provider.enough))
         usleep(session_is_lost ? 20000 : 1000);
     usleep(20000);
@@ -142,14 +133,10 @@ void live_and_end(bool session_is_lost) {
 
 TEST(AlarmSession, EngineThreadsRaiseAlarmsThroughItsWholeLife) {
     for (const bool session_is_lost : {false, true}) {
-        const pid_t child = fork();
-        if (child == 0) {
+        const pid_t child = start_child([&]() -> int {
             live_and_end(session_is_lost);
-            exit(testing::Test::HasFailure() ? 1 : 0);
-        }
-        int status = -1;
-        ASSERT_EQ(waitpid(child, &status, 0), child);
-        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0)
-            << "status " << status << (session_is_lost ? ", session lost" : ", shut down");
+            exit(testing::Test::HasFailure());
+        });
+        EXPECT_EQ(wait_for_child(child), 0) << (session_is_lost ? "session lost" : "shut down");
     }
 }

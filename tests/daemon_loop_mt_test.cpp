@@ -8,6 +8,8 @@
 
 namespace {
 
+std::atomic<int> carried, withdrawn; // posted work of this loop_thread
+
 struct loop_thread {
     lew *wrapper = nullptr;
     loop_context *loop = nullptr;
@@ -24,16 +26,15 @@ struct loop_thread {
         if (self->first)
             self->first();
     }
-    void run() {
-        ASSERT_EQ(lew_init(&wrapper), LC_OK);
-        ASSERT_EQ(lew_get_event_context(wrapper, &loop), LC_OK);
-        ASSERT_EQ(loop_event_new(loop, run_first, this, &starter), LC_OK);
-        ASSERT_EQ(loop_event_set_timer(starter, 0), LC_OK);
-        ready = 1;
-        EXPECT_EQ(lew_dispatch(wrapper, nullptr, &escaped), LC_OK);
-    }
     void start() {
-        thread = std::thread([this] { run(); });
+        carried = withdrawn = 0;
+        thread = std::thread([this] {
+            ASSERT_TRUE(lew_init(&wrapper) == LC_OK && lew_get_event_context(wrapper, &loop) == LC_OK);
+            ASSERT_EQ(loop_event_new(loop, run_first, this, &starter), LC_OK);
+            ASSERT_EQ(loop_event_set_timer(starter, 0), LC_OK);
+            ready = 1;
+            EXPECT_EQ(lew_dispatch(wrapper, nullptr, &escaped), LC_OK);
+        });
         while (!ready)
             usleep(1000);
     }
@@ -44,33 +45,8 @@ struct loop_thread {
     }
 };
 
-TEST(LoopThreads, AnEscapeFromOutsideEndsTheWaitAtEachDepth) {
-    for (const bool nested : {false, true}) {
-        loop_thread it;
-        std::atomic<int> inner{-1};
-        if (nested)
-            it.first = [&] {
-                int escaped = 0;
-                while (!escaped)
-                    ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, &escaped), LC_OK);
-                inner = escaped;
-            };
-        it.start();
-        usleep(50000);
-        const int64_t start = lt_monotonic_ms();
-        EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
-        it.finish();
-        EXPECT_LT(lt_monotonic_ms() - start, 2000);
-        EXPECT_TRUE(it.escaped == 1 && inner == (nested ? 1 : -1));
-    }
-}
-
-struct counts {
-    std::atomic<int> carried{0}, withdrawn{0};
-};
 struct counted_post {
     loop_post post{};
-    counts *all;
     loop_context *loop;
     int number;
     int *expected;
@@ -79,18 +55,17 @@ struct counted_post {
         if (carry_out) {
             EXPECT_TRUE(loop_is_own_thread(self->loop) && self->number == (*self->expected)++);
         }
-        (carry_out ? self->all->carried : self->all->withdrawn)++;
+        (carry_out ? carried : withdrawn)++;
         delete self;
     }
-    static void send(counts *all, loop_context *loop, int number, int *expected) {
-        auto *record = new counted_post{{nullptr, expected, function}, all, loop, number, expected};
+    static void send(loop_context *loop, int number, int *expected) {
+        auto *record = new counted_post{{nullptr, expected, function}, loop, number, expected};
         loop_post_work(loop, &record->post);
     }
 };
 
 TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     constexpr int posters = 3, each = 2000;
-    counts all;
     int expected[posters] = {}, unused[2] = {};
     loop_thread it;
     it.start();
@@ -98,45 +73,48 @@ TEST(LoopThreads, PostedWorkIsCarriedOutInOrderOnTheOwnersThread) {
     for (int poster = 0; poster < posters; poster++)
         threads[poster] = std::thread([&, poster] {
             for (int i = 0; i < each; i++)
-                counted_post::send(&all, it.loop, i, &expected[poster]);
+                counted_post::send(it.loop, i, &expected[poster]);
         });
     for (std::thread &thread : threads)
         thread.join();
-    for (const int64_t start = lt_monotonic_ms();
-         all.carried < posters * each && lt_monotonic_ms() - start < 4000;)
+    for (int i = 0; carried < posters * each && i < 4000; i++)
         usleep(1000);
-    EXPECT_TRUE(all.carried == posters * each && lew_escape_from_dispatch(it.wrapper) == LC_OK);
+    EXPECT_TRUE(carried == posters * each && lew_escape_from_dispatch(it.wrapper) == LC_OK);
     it.thread.join();
     // Later posts are handed back when they are withdrawn or the loop is freed.
     for (int &poster : unused)
-        counted_post::send(&all, it.loop, 0, &poster);
+        counted_post::send(it.loop, 0, &poster);
     loop_withdraw_posted(it.loop, &unused[0]);
-    EXPECT_EQ(all.withdrawn, 1);
+    EXPECT_EQ(withdrawn, 1);
     it.thread = std::thread([] {});
     it.finish();
-    EXPECT_EQ(all.withdrawn, 2);
+    EXPECT_EQ(withdrawn, 2);
 }
 
 // Posted work ends a wait for one round, because it may have changed what is waited for.
-TEST(LoopThreads, PostedWorkEndsANestedWait) {
-    counts all;
-    std::atomic<int> waiting{0};
-    int expected = 0;
-    loop_thread it;
-    it.first = [&] {
-        waiting = 1;
-        while (!all.carried)
-            ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, nullptr), LC_OK);
-        ASSERT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
-    };
-    it.start();
-    while (!waiting)
-        usleep(1000);
-    usleep(20000);
-    const int64_t start = lt_monotonic_ms();
-    counted_post::send(&all, it.loop, 0, &expected);
-    it.finish();
-    EXPECT_LT(lt_monotonic_ms() - start, 2000);
+TEST(LoopThreads, PostedWorkAndEscapesEndTheWaitAtEachDepth) {
+    for (const bool nested : {false, true}) {
+        std::atomic<int> ended{0}; // waits of the callback
+        int expected = 0;
+        loop_thread it;
+        if (nested)
+            it.first = [&] {
+                int escaped = 0;
+                for (; !carried || !escaped; ended = escaped + 1)
+                    ASSERT_EQ(lew_dispatch_once(it.wrapper, nullptr, &escaped), LC_OK);
+            };
+        it.start();
+        usleep(50000);
+        const int64_t start = lt_monotonic_ms();
+        counted_post::send(it.loop, 0, &expected);
+        for (int i = 0; ended < (nested ? 1 : 0) && i < 3000; i++)
+            usleep(1000);
+        usleep(20000);
+        EXPECT_EQ(lew_escape_from_dispatch(it.wrapper), LC_OK);
+        it.finish();
+        EXPECT_LT(lt_monotonic_ms() - start, 2000);
+        EXPECT_TRUE(carried == 1 && it.escaped == 1 && ended == (nested ? 2 : 0));
+    }
 }
 
 } // namespace

@@ -2,9 +2,6 @@
 // What mgmtd and wccpd make of those of groups is the subject of tests/scenario_mgmtctl_groups.sh.
 #include <gtest/gtest.h>
 
-#include <map>
-#include <sstream>
-
 #include "mgmt/node_paths.h"
 #include "peers/mgmtctl/groups.h"
 #include "peers/mgmtctl/intercepts.h"
@@ -53,12 +50,11 @@ struct fake {
                     out->bindings.push_back({node, "string", value});
             return true;
         };
-        link.set = [this](const std::vector<ctl_change_item> &items, ctl_reply *out,
-                          std::string *out_reason) {
+        link.set = [this](const std::vector<ctl_change_item> &items, ctl_reply *out, std::string *reason) {
             commits.push_back(items);
             out->code = code;
             out->message = "not like that";
-            *out_reason = "mgmtd closed the session";
+            *reason = "mgmtd closed the session";
             return out->code != 1;
         };
         return link;
@@ -87,18 +83,15 @@ void expect_refused(Result (fake::*command)(const std::string &), int exit, cons
 } // namespace
 
 TEST(Groups, WrongWordsChangeNothingAndAreTold) {
-    const auto check = [](int exit, const char *words, const char *told) {
-        expect_refused(&fake::group, exit, words, told);
-    };
-    check(CTL_USAGE, "add 52 wieght 7", "did you mean \"weight\"?");
-    check(CTL_USAGE, "add 52 zzzzzzzz 7", "known are");
-    check(CTL_USAGE, "ad 52", "did you mean \"add\"?");
-    check(CTL_USAGE, "add 5x", "group add N");
-    check(CTL_USAGE, "add 52 weight", "needs a value: 0 to 65535");
-    check(CTL_USAGE, "set 51 router 10.0.0.1 router 10.0.0.1", "given twice");
-    check(CTL_REFUSED, "add 51", "there is a group 51");
-    check(CTL_NOT_FOUND, "restart 52", "there is no group 52");
-    check(CTL_USAGE, "restart 51 now", "group add N");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 wieght 7", "did you mean \"weight\"?");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 zzzzzzzz 7", "known are");
+    expect_refused(&fake::group, CTL_USAGE, "ad 52", "did you mean \"add\"?");
+    expect_refused(&fake::group, CTL_USAGE, "add 5x", "group add N");
+    expect_refused(&fake::group, CTL_USAGE, "add 52 weight", "needs a value: 0 to 65535");
+    expect_refused(&fake::group, CTL_USAGE, "set 51 router 10.0.0.1 router 10.0.0.1", "given twice");
+    expect_refused(&fake::group, CTL_REFUSED, "add 51", "there is a group 51");
+    expect_refused(&fake::group, CTL_NOT_FOUND, "restart 52", "there is no group 52");
+    expect_refused(&fake::group, CTL_USAGE, "restart 51 now", "group add N");
 }
 
 TEST(Groups, OneCommitWhereARunningGroupFollows) {
@@ -108,8 +101,7 @@ TEST(Groups, OneCommitWhereARunningGroupFollows) {
     EXPECT_EQ(mgmtd.group("set 51 weight 7 password default policy 5").done, "changed");
     EXPECT_EQ(mgmtd.sent(), "modify /password=default;modify /policy_grp=5;modify /weight=7;");
     mgmtd.nodes[ROOT + "/weight"] = "7";
-    EXPECT_EQ(mgmtd.group("set 51 weight default").commits, 1);
-    EXPECT_EQ(mgmtd.sent(), "reset /weight=;");
+    EXPECT_TRUE(mgmtd.group("set 51 weight default").commits == 1 && mgmtd.sent() == "reset /weight=;");
     EXPECT_EQ(mgmtd.group("set 51 encap l2 assign mask weight 8").note,
               "a running group applies a change of assign, encap only when it is restarted: "
               "mgmtctl group restart 51");
@@ -124,8 +116,7 @@ TEST(Groups, AsAWholeItIsOneCommitAsWell) {
     EXPECT_EQ(mgmtd.sent(), "create /router/2/ipaddr=10.0.0.2;modify /weight=7;");
     result = mgmtd.group("set 51 router none interface none");
     EXPECT_EQ(mgmtd.sent(), "remove /router/1=;reset /interface=;");
-    EXPECT_TRUE(
-        contains(result.note, "router, interface only by recreating the group; without an interface"));
+    EXPECT_TRUE(contains(result.note, "router, interface only by recreating the group; without an"));
     EXPECT_EQ(mgmtd.group("restart 51").done, "recreated");
     EXPECT_EQ(mgmtd.sent(), "remove =;create =51;create /interface=eth0;create /password=a 'b;create "
                             "/router/1/ipaddr=10.0.0.1;");
@@ -144,25 +135,21 @@ TEST(Groups, AsAWholeItIsOneCommitAsWell) {
 static const std::string INTERCEPT = NODE_INTERCEPT_CONFIG "/51";
 
 TEST(Intercepts, WrongClausesChangeNothingAndAreTold) {
-    const auto check = [](const char *words, const char *told) {
-        expect_refused(&fake::intercept, CTL_USAGE, words, told);
-    };
-    check("ad 51", "did you mean \"add\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "ad 51", "did you mean \"add\"?");
     for (const char *words : {"add 51", "set 51", "delete 51 to 1", "add 5x all to 3128"})
-        check(words, "intercept add GROUP");
-    check("add 51 port 80", "\"to\" is missing");
-    check("add 51 to 80", "\"all\" is missing");
-    check("add 51 port to 80", "\"port\" needs a value");
-    check("add 51 port 80 all to 1", "exclude each other");
-    check("add 51 port 80 tp 3128", "did you mean \"to\"?");
-    check("set 51 to none", "\"to\" needs a value");
-    check("set 51 rise 2 rise 3", "given twice");
-    check("set 51 check htp /", "did you mean \"http\"?");
-    check("set 51 check http rise 2", "needs the path of a page");
-    check("add 51 all port 80 to 1", "\"all\" exclude each other");
-    check("add 51 all all to 1", "\"all\" is given twice");
-    check("show x", "intercept show [GROUP]");
-    check("set 51 bypass", "\"bypass\" needs a value");
+        expect_refused(&fake::intercept, CTL_USAGE, words, "intercept add GROUP");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80", "\"to\" is missing");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 to 80", "\"all\" is missing");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port to 80", "\"port\" needs a value");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80 all to 1", "exclude each other");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 port 80 tp 3128", "did you mean \"to\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 to none", "\"to\" needs a value");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 rise 2 rise 3", "given twice");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 check htp /", "did you mean \"http\"?");
+    expect_refused(&fake::intercept, CTL_USAGE, "set 51 check http rise 2", "needs the path of a page");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 all port 80 to 1", "\"all\" exclude each other");
+    expect_refused(&fake::intercept, CTL_USAGE, "add 51 all all to 1", "\"all\" is given twice");
+    expect_refused(&fake::intercept, CTL_USAGE, "show x", "intercept show [GROUP]");
     expect_refused(&fake::intercept, CTL_NOT_FOUND, "set 51 rise 2", "no intercept for group 51");
 }
 
@@ -184,8 +171,7 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
                         {INTERCEPT + "/check_argument", "/x"}});
     mgmtd.session_after = 2; // tunneld has just been started
     result = mgmtd.intercept("set 51 port 443 80 rise 2 check http /x");
-    EXPECT_EQ(result.done + result.tunneld, "unchangedrunning");
-    EXPECT_TRUE(mgmtd.commits.empty());
+    EXPECT_TRUE(result.done + result.tunneld == "unchangedrunning" && mgmtd.commits.empty());
     EXPECT_EQ(mgmtd.intercept("set 51 check tcp all").done, "changed");
     EXPECT_EQ(mgmtd.sent(INTERCEPT), "create /check=tcp;reset /check_argument=;create /ports=all;");
     EXPECT_EQ(mgmtd.intercept("add 51 all to 1").exit, CTL_REFUSED);
@@ -201,20 +187,16 @@ TEST(Intercepts, ClausesInAnyOrderAreOneCommit) {
     EXPECT_EQ(mgmtd.intercept("delete 52").exit, CTL_NOT_FOUND);
     mgmtd.code = LC_BAD_ARGUMENT;
     result = mgmtd.intercept("set 51 to 70000");
-    EXPECT_EQ(result.exit, CTL_REFUSED);
-    EXPECT_EQ(result.done + result.error, "not like that");
+    EXPECT_TRUE(result.exit == CTL_REFUSED && result.done + result.error == "not like that");
 }
 
 TEST(Bypasses, HaveOneNameAndEndByThemselves) {
-    const auto refuse = [](const char *words, const char *told) {
-        expect_refused(&fake::bypass, CTL_USAGE, words, told);
-    };
-    refuse("add 10.0.0.1/8", "host bits");
-    refuse("add 10.0.0.0/8 fro 60", "did you mean \"for\"?");
-    refuse("add 10.0.0.0/8 for 0", "number of seconds");
-    refuse("add 10.0.0.0/8 for 4294967296", "number of seconds");
-    refuse("add 10.0.0.0/8 for", "bypass add PREFIX");
-    refuse("delete 10.0.0.0/8 for 1", "bypass add PREFIX");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.1/8", "host bits");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 fro 60", "did you mean \"for\"?");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for 0", "number of seconds");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for 4294967296", "number of seconds");
+    expect_refused(&fake::bypass, CTL_USAGE, "add 10.0.0.0/8 for", "bypass add PREFIX");
+    expect_refused(&fake::bypass, CTL_USAGE, "delete 10.0.0.0/8 for 1", "bypass add PREFIX");
     fake mgmtd;
     EXPECT_EQ(mgmtd.bypass("add 10.0.0.0/08").exit, CTL_OK);
     EXPECT_EQ(mgmtd.sent(NODE_BYPASS_CONFIG), "create /10.0.0.0\\/8=;");
@@ -226,13 +208,10 @@ TEST(Bypasses, HaveOneNameAndEndByThemselves) {
 }
 
 TEST(Tunnels, FurtherSourcesAreAcceptedAndTakenBack) {
-    const auto refuse = [](const char *words, const char *told) {
-        expect_refused(&fake::tunnel, CTL_USAGE, words, told);
-    };
-    refuse("acept 10.0.0.9", "did you mean \"accept\"?");
-    refuse("accept 10.0.0", "\"10.0.0\" is no IPv4 address");
-    refuse("accept 10.0.0.9 for 9", "known are router");
-    refuse("refuse 10.0.0.9 router 10.0.0.1", "tunnel accept ADDRESS");
+    expect_refused(&fake::tunnel, CTL_USAGE, "acept 10.0.0.9", "did you mean \"accept\"?");
+    expect_refused(&fake::tunnel, CTL_USAGE, "accept 10.0.0", "\"10.0.0\" is no IPv4 address");
+    expect_refused(&fake::tunnel, CTL_USAGE, "accept 10.0.0.9 for 9", "known are router");
+    expect_refused(&fake::tunnel, CTL_USAGE, "refuse 10.0.0.9 router 10.0.0.1", "tunnel accept ADDRESS");
     fake mgmtd;
     mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8"] = "10.0.0.8";
     mgmtd.nodes[NODE_ACCEPT_CONFIG "/10.0.0.8/router"] = "10.0.0.1";

@@ -2,17 +2,13 @@
 // and the engine share with the table of metrics.
 #include <algorithm>
 #include <regex>
-#include <set>
 
 #include <gtest/gtest.h>
 
-#include "mgmt/node_paths.h"
 #include "peers/mgmtctl/metrics.h"
 #include "peers/nodes/schema.h"
 #include "tests/support/canned_nodes.h"
 #include "tests/support/texts.h"
-
-static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
 
 static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
     return [known = canned_nodes{nodes}](ctl_walk walk, const strings &names, ctl_reply *out) mutable {
@@ -21,7 +17,8 @@ static metric_source answered_by(const std::vector<ctl_binding> &nodes) {
 }
 
 // The text of what is gathered; gathering has to end like this.
-static std::string metrics_of(const metric_source &source, metric_format format, bool complete = true) {
+static std::string metrics_of(const metric_source &source, bool complete = true,
+                              metric_format format = metric_format::text) {
     metric_lines samples;
     EXPECT_EQ(gather_metrics(source, &samples), complete);
     return joined(metrics_text(samples, format), "");
@@ -29,30 +26,24 @@ static std::string metrics_of(const metric_source &source, metric_format format,
 
 // Only numbers become values, texts cannot leave their labels, and a daemon that is gone is reported as down.
 TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
-    const std::vector<ctl_binding> known = {
-        {NODE_WCCPD_VERSION, "string", "1.0.0"},
-        {NODE_WCCPD_STATE "/metric/all", "string",
-         "counter rx_failures 9\ninterface eth0 1 2 3 4 5\ninterface a b 1 2 3 4 5\nreason group-unknown "
-         "10.0.0.7 1 2\n"},
-        {STATES + "/51", "string", "51"},
-        {STATES + "/51/metric/all", "string",
-         "gauge active 1\ngauge pending_acks x\ncounter rx_icus 5\ncounter Bad{} 5\n"
-         "router 10.0.0.1 10.0.0.9 1 3 40 128 256\nrouter 10.0.0.2\nnothing 1\n"
-         "reason password-mismatch 10.0.0.1 7 2"},
-        {NODE_PLANE_STATE "/name", "string", "user"},
-        {NODE_PLANE_STATE "/refused/source", "uint64", "4"},
-        {NODE_TUNNEL_STATE "/232", "uint16", "232"},
-        {NODE_TUNNEL_STATE "/232/remote", "ipv4addr", "10.0.0.1"},
-        {NODE_TUNNEL_STATE "/232/to_proxy_bytes", "uint64", "99"},
-        {NODE_INTERCEPT_STATE "/51", "uint8", "51"},
-        {NODE_INTERCEPT_STATE "/51/proxy", "string", "unknown"},
-        {NODE_INTERCEPT_STATE "/51/proxy_ms", "uint64", "1500"},
-        {NODE_INTERCEPT_STATE "/51/weight_percent", "uint32", "5"},
-        {NODE_PROTECTION_STATE "/member/10.0.0.102/passed", "uint64", "3"},
-        {NODE_ALARMS_RAISED "/196638/a\"b\\\\c", "string", "text"},
-        {NODE_PROCESSES "/wccpd", "string", "running"},
-        {NODE_PROCESSES "/wccpd/restarts", "uint32", "2"}};
-    const std::string modern = "\n" + metrics_of(answered_by(known), metric_format::openmetrics);
+    const std::vector<ctl_binding> known = bindings_of(
+        "/qv",
+        "%/wccpd/system/state/version string 1.0.0|"
+        "%/wccpd/system/state/metric/all string counter rx_failures 9\ninterface eth0 1 2 3 4 5\n"
+        "interface a b 1 2 3 4 5\nreason group-unknown 10.0.0.7 1 2\n|"
+        "%/wccpd/wccp/srv_grp/state/51 string 51|"
+        "%/wccpd/wccp/srv_grp/state/51/metric/all string gauge active 1\ngauge pending_acks x\n"
+        "counter rx_icus 5\ncounter Bad{} 5\nrouter 10.0.0.1 10.0.0.9 1 3 40 128 256\nrouter 10.0.0.2\n"
+        "nothing 1\nreason password-mismatch 10.0.0.1 7 2|"
+        "%/tunneld/plane/state/name string user|%/tunneld/plane/state/refused/source uint64 4|"
+        "%/tunneld/tunnel/state/232 uint16 232|%/tunneld/tunnel/state/232/remote ipv4addr 10.0.0.1|"
+        "%/tunneld/tunnel/state/232/to_proxy_bytes uint64 99|%/tunneld/intercept/state/51 uint8 51|"
+        "%/tunneld/intercept/state/51/proxy string unknown|%/tunneld/intercept/state/51/proxy_ms uint64 1500|"
+        "%/tunneld/intercept/state/51/weight_percent uint32 5|"
+        "%/tunneld/protection/state/member/10.0.0.102/passed uint64 3|"
+        "%/alarms/state/raised/196638/a\"b\\\\c string text|"
+        "%/alarms/state/process/wccpd string running|%/alarms/state/process/wccpd/restarts uint32 2|");
+    const std::string modern = "\n" + metrics_of(answered_by(known), true, metric_format::openmetrics);
     for (const char *line :
          {"wccp_build_info{version=\"1.0.0\"} 1", "# TYPE wccp_build info", "wccp_rx_failures_total 9",
           "wccp_interface_link_downs_total{interface=\"eth0\"} 4",
@@ -70,23 +61,16 @@ TEST(Metrics, AreMadeOfStatesAndReadInBothFormats) {
         EXPECT_TRUE(contains(modern, "\n" + std::string(line) + "\n"));
     EXPECT_TRUE(lacks(modern, "pending_acks{", "Bad", "nothing", "wccp_proxy_up{", "router=\"10.0.0.2\"",
                       "interface=\"a\""));
-    EXPECT_TRUE(contains(modern, "source=\"a\\\"b"));
-    EXPECT_TRUE(modern.ends_with("\n# EOF\n"));
-    EXPECT_TRUE(contains(metrics_of(answered_by(known), metric_format::text),
-                         "# TYPE wccp_group_rx_icus_total counter\n"));
-    EXPECT_TRUE(
-        contains(metrics_of(answered_by({}), metric_format::text), "wccp_daemon_up{daemon=\"wccpd\"} 0\n"));
+    EXPECT_TRUE(contains(modern, "source=\"a\\\"b") && modern.ends_with("\n# EOF\n"));
+    EXPECT_TRUE(contains(metrics_of(answered_by(known)), "# TYPE wccp_group_rx_icus_total counter\n"));
+    EXPECT_TRUE(contains(metrics_of(answered_by({})), "wccp_daemon_up{daemon=\"wccpd\"} 0\n"));
     const auto silent = [](ctl_walk, const std::vector<std::string> &, ctl_reply *) { return false; };
-    EXPECT_TRUE(
-        metrics_of(silent, metric_format::text, false).ends_with("\nwccp_daemon_up{daemon=\"mgmtd\"} 0\n"));
+    EXPECT_TRUE(metrics_of(silent, false).ends_with("\nwccp_daemon_up{daemon=\"mgmtd\"} 0\n"));
 }
 
-static std::string text_of_source(const std::string &name) {
-    return text_of_file(WCCP_SOURCE_DIR "/" + name);
-}
 // All that the pattern's group of this number matches in a file; at least so many.
 static strings found_in(const std::string &name, const char *pattern, int group, size_t least) {
-    const std::string text = text_of_source(name);
+    const std::string text = text_of_file(WCCP_SOURCE_DIR "/" + name);
     const std::regex expression(pattern);
     const strings found(std::sregex_token_iterator(text.begin(), text.end(), expression, group), {});
     EXPECT_GE(found.size(), least) << name;
@@ -96,7 +80,7 @@ static strings found_in(const std::string &name, const char *pattern, int group,
 // The documents, the dashboard and the alert rules name metrics that exist, and each number of the engine has
 // one.
 TEST(Metrics, AreTheOnesThatOthersName) {
-    const std::string document = text_of_source("docs/metrics.md");
+    const std::string document = text_of_file(WCCP_SOURCE_DIR "/docs/metrics.md");
     std::set<std::string> names;
     for (const metric_family &family : metric_families) {
         const char *const kinds[] = {"gauge", "counter", "info"}, *const suffixes[] = {"", "_total", "_info"};
@@ -121,30 +105,22 @@ TEST(Metrics, AreTheOnesThatOthersName) {
 
 // The documents list exactly the nodes that exist.
 TEST(Nodes, AreInTheDocuments) {
-    static const std::set<std::string> ways = {"in",  "to_proxy",  "bypassed", "returned", "down",
-                                               "own", "forwarded", "dropped",  "passed",   "overload"};
+    const std::regex way(
+        "^((?!.*/member/).*/\\*)/"
+        "(in|to_proxy|bypassed|returned|down|own|forwarded|dropped|passed|overload)(_bytes)?$");
     const strings rows = found_in("docs/states.md", "\n\\| (/qv/(wccpd|tunneld)/[^ ]+) \\|", 1, 9);
     const std::set<std::string> documented(rows.begin(), rows.end());
     std::set<std::string> wanted;
     for (const auto *list : {&wccpd_state_nodes(), &tunneld_state_nodes()})
         for (const std::string node : *list) {
-            std::string last = node.substr(node.rfind('/') + 1);
-            const std::string above = node.substr(0, node.rfind('/'));
-            if (last.ends_with("_bytes"))
-                last.resize(last.size() - 6);
-            const bool sorted =
-                above.ends_with("/*") && ways.contains(last) && above.find("/member/") == std::string::npos;
+            const auto is_below = [&](const std::string &other) { return other.starts_with(node + "/"); };
             // A node that only has others below it needs no row.
-            if (sorted || last != "*" || documented.contains(node))
-                wanted.insert(sorted ? above + "/WAY" : node);
-            else
-                EXPECT_TRUE(std::ranges::any_of(*list, [&](const char *other) {
-                    return std::string(other).starts_with(node + "/");
-                })) << node;
+            if (!node.ends_with("*") || documented.contains(node) || std::ranges::none_of(*list, is_below))
+                wanted.insert(std::regex_replace(node, way, "$1/WAY"));
         }
     EXPECT_EQ(documented, wanted);
 
-    const std::string configured = text_of_source("docs/mgmtd.md");
+    const std::string configured = text_of_file(WCCP_SOURCE_DIR "/docs/mgmtd.md");
     for (const schema_row &one : schema_rows()) {
         const std::string last = one.parts.parts.back();
         EXPECT_TRUE(last == "*" || std::regex_search(configured, std::regex("/" + last + "[ ,]")))

@@ -1,14 +1,8 @@
 // mgmtctl without mgmtd: what it shows, what it says of changes and of names that don't exist, and its
 // session with a provider made by hand.
 #include <arpa/inet.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
-#include <algorithm>
-#include <cerrno>
 #include <filesystem>
-#include <functional>
-#include <sstream>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -24,34 +18,28 @@
 #include "tests/support/gcl_provider.h"
 #include "tests/support/texts.h"
 
-static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config";
-static const std::string G51 = GROUPS + "/51";
-static const std::string STATES = "/qv/wccpd/wccp/srv_grp/state";
+static const std::string GROUPS = "/qv/wccpd/wccp/srv_grp/config", G51 = GROUPS + "/51",
+                         STATES = "/qv/wccpd/wccp/srv_grp/state";
 
 // --- What is shown
 
 TEST(Shown, ValuesAreNumbersForAScriptAndPasswordsStarsForAll) {
-    const struct {
-        ctl_binding binding;
-        const char *json, *text;
-    } cases[] = {
-        {{"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n"},
-        {{"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n"},
-        {{"/a", "bool", "true"}, "true", "/a = true\n"},
-        {{"/a", "string", "7"}, "\"7\"", "/a = 7\n"},
-        {{"/a", "none", ""}, "null", "/a =\n"},
-        {{"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n"},
-        {{"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n"},
-        {{"/a/password", "string", ""}, "\"\"", "/a/password =\n"},
-        {{"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
-         "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
-         "/a/debug =\n    WCCP password  : ********\n    x: y\n     WCCP password : ********\n    WCCP "
-         "password\n"},
+    const auto check = [](const ctl_binding &binding, const std::string &json, const char *text) {
+        EXPECT_EQ(json_line(json_node(binding, false)["value"]), json + "\n");
+        EXPECT_EQ(text_node(binding, false), text);
     };
-    for (const auto &one : cases) {
-        EXPECT_EQ(json_line(json_node(one.binding, false)["value"]), std::string(one.json) + "\n");
-        EXPECT_EQ(text_node(one.binding, false), one.text);
-    }
+    check({"/a", "uint32", "4294967295"}, "4294967295", "/a = 4294967295\n");
+    check({"/a", "float64", "nan"}, "\"nan\"", "/a = nan\n");
+    check({"/a", "bool", "true"}, "true", "/a = true\n");
+    check({"/a", "string", "7"}, "\"7\"", "/a = 7\n");
+    check({"/a", "none", ""}, "null", "/a =\n");
+    check({"/a", "string", "x\n y\n\n"}, "\"x\\n y\\n\\n\"", "/a =\n    x\n     y\n");
+    check({"/a", "string", "\xff"}, "\"\\ufffd\"", "/a = \xff\n");
+    check({"/a/password", "string", ""}, "\"\"", "/a/password =\n");
+    check({"/a/debug", "string", "WCCP password  : ab 0x61\nx: y\n WCCP password : \nWCCP password"},
+          "\"WCCP password  : ********\\nx: y\\n WCCP password : ********\\nWCCP password\"",
+          "/a/debug =\n    WCCP password  : ********\n    x: y\n     WCCP password : ********\n    WCCP "
+          "password\n");
 }
 
 TEST(Shown, AnEventIsALineAndAnObject) {
@@ -72,24 +60,20 @@ TEST(Shown, AnEventIsALineAndAnObject) {
 }
 
 TEST(Shown, AChangeTellsBothSidesAndNoSecret) {
-    const std::string entry = "/mgmtd/notification/dbchange/";
-    const ctl_event change = {EVENT_CONFIG_CHANGE,
-                              {{entry + "09", "uint32", "9"},
-                               {entry + "09/change_type", "string", "modify"},
-                               {entry + "09/name", "string", G51 + "/password"},
-                               {entry + "09/new_attribs/value", "string", "neu"},
-                               {entry + "09/prev_attribs/value", "string", "alt"},
-                               {entry + "11/change_type", "string", "delete"},
-                               {entry + "11/name", "string", G51 + "/policy_grp"},
-                               {entry + "11/prev_attribs/value", "uint32", "3"}}};
+    const ctl_event change = {
+        EVENT_CONFIG_CHANGE,
+        bindings_of("/mgmtd/notification/dbchange/",
+                    "%09 uint32 9|%09/change_type string modify|%09/name string " + G51 +
+                        "/password|%09/new_attribs/value string neu|%09/prev_attribs/value string alt|"
+                        "%11/change_type string delete|%11/name string " +
+                        G51 + "/policy_grp|%11/prev_attribs/value uint32 3|")};
     EXPECT_EQ(text_event(change, false), (strings{"modify " + G51 + "/password = ******** (was ********)",
                                                   "delete " + G51 + "/policy_grp (was 3)"}));
     const ctl_json told = json_event(change, true);
     EXPECT_EQ(told["changes"].items[0]["after"].text, "neu");
-    EXPECT_EQ(json_line(told["changes"].items[1]),
+    EXPECT_EQ(json_text(told["changes"].items[1]),
               "{\"name\":\"" + G51 +
-                  "/policy_grp\",\"change\":\"delete\",\"type\":\"uint32\","
-                  "\"before\":3,\"after\":null}\n");
+                  R"(/policy_grp","change":"delete","type":"uint32","before":3,"after":null})");
 }
 
 TEST(Shown, JsonIsWrittenInAsciiAndReadToADepth) {
@@ -109,14 +93,13 @@ TEST(Shown, JsonIsWrittenInAsciiAndReadToADepth) {
 // --- Changes
 
 TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
-    const groups_before before = {{G51, GROUPS + "/52"},
-                                  {{G51 + "/priority", "uint32", "10"},
-                                   {G51 + "/protocol", "string", "tcp"},
-                                   {G51 + "/policy_grp", "uint32", "3"},
-                                   {G51 + "/weight", "uint32", "100"},
-                                   {G51 + "/router/1", "uint8", "1"}}};
-    const auto check = [&](const char *changes, const strings &created, const char *note) { // a piece of it
-        std::vector<ctl_change_item> items; // NAME=VALUE, or NAME to remove it
+    const groups_before before = {
+        {G51, GROUPS + "/52"},
+        bindings_of(G51, "%/priority uint32 10|%/protocol string tcp|%/policy_grp uint32 3|"
+                         "%/weight uint32 100|%/router/1 uint8 1|")};
+    const auto check = [&](const char *changes, const strings &created,
+                           const char *note) { // a piece of it
+        std::vector<ctl_change_item> items;    // NAME=VALUE, or NAME to remove it
         std::istringstream words(changes);
         for (std::string word; words >> word;) {
             const size_t end = std::min(word.find('='), word.size());
@@ -125,8 +108,7 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
                  {GROUPS + "/" + word.substr(0, end), "", word.substr(std::min(end + 1, word.size()))}});
         }
         const change_notes said = notes_of(items, before);
-        EXPECT_EQ(said.created, created) << changes;
-        EXPECT_EQ(said.notes.size(), *note ? 1u : 0u) << changes;
+        EXPECT_TRUE(said.created == created && said.notes.size() == (*note ? 1 : 0)) << changes;
         EXPECT_TRUE(contains(joined(said.notes, ""), note));
     };
     check("51/weight=7", {}, "");
@@ -210,42 +192,37 @@ TEST(Changes, AWholeConfigurationIsItsDifference) {
     ASSERT_TRUE(
         read_config(section + "router/2/ipaddr = 10.0.0.2\n", "F", before.tree, true, &after, &errors));
     EXPECT_EQ(items_of(config_changes(before.tree, after), after).size(), 2u) << "the rest stays";
-    const auto refuse = [&](const std::string &content, const std::string &error) { // "G" is the group
+    const auto refuse = [&](const std::string &content, const std::string &error) {
         EXPECT_FALSE(read_config(content, "F", before.tree, false, &after, &errors));
-        const size_t at = error.find('G');
-        EXPECT_TRUE(
-            errors.starts_with("F:" + (at < 4 ? error.substr(0, at) + G51 + error.substr(at + 1) : error)))
-            << errors;
+        EXPECT_EQ(errors.substr(0, error.size()), error);
     };
-    refuse(section + "password = ********\n",
-           "2: G/password: the password is hidden, and there is none here");
-    refuse(section + "weight = x\n", "2: G/weight: \"x\" is not a valid uint32\n");
-    refuse("{", " is not a JSON object of nodes and their values\n");
-    refuse(" {\"/a\": 1}", " /a: there is no such node in the configuration\n");
-    refuse("{\"" + G51 + "/weight\": {\"a\": [[1]]}}", " G/weight: the value is neither a text nor");
-    refuse("{\"" + G51 + "/weight\": 1.5}", " G/weight: \"1.5\" is not a valid uint32\n");
-    refuse("{\"" + G51 + "\": 51, \"" + G51 + "\": 51}", " G: is given twice\n");
-    refuse("{\"" + G51 + "/router/2/ipaddr\": \"10.0.0.2\"}", " G/router: entries are numbered from 1");
-    refuse(std::string(1 << 20, '{'), " is not a JSON object");
-    refuse("{\"" + G51 + "\":" + std::string(1 << 20, '['), " is not a JSON object");
+    refuse(section + "password = ********\n", "F:2: " + G51 + "/password: the password is hidden, and");
+    refuse(section + "weight = x\n", "F:2: " + G51 + "/weight: \"x\" is not a valid uint32\n");
+    refuse("{", "F: is not a JSON object of nodes and their values\n");
+    refuse(" {\"/a\": 1}", "F: /a: there is no such node in the configuration\n");
+    refuse("{\"" + G51 + "/weight\": {\"a\": [[1]]}}",
+           "F: " + G51 + "/weight: the value is neither a text nor");
+    refuse("{\"" + G51 + "/weight\": 1.5}", "F: " + G51 + "/weight: \"1.5\" is not a valid uint32\n");
+    refuse("{\"" + G51 + "\": 51, \"" + G51 + "\": 51}", "F: " + G51 + ": is given twice\n");
+    refuse("{\"" + G51 + "/router/2/ipaddr\": \"10.0.0.2\"}",
+           "F: " + G51 + "/router: entries are numbered from 1");
+    refuse(std::string(1 << 20, '{'), "F: is not a JSON object");
+    refuse("{\"" + G51 + "\":" + std::string(1 << 20, '['), "F: is not a JSON object");
 }
 
 // --- Names
 
 static canned_nodes sample_nodes() {
-    return {{{G51, "uint8", "51"},
-             {G51 + "/weight", "uint32", "100"},
-             {GROUPS + "/7", "uint8", "7"},
-             {"/logging/syslog/process/wccpd/log_level", "string", "info"},
-             {STATES + "/51", "string", "51"},
-             {STATES + "/51/num_appliances", "uint32", "2"},
-             {STATES + "/51/oper", "string", "ACTIVE"},
-             {STATES + "/51/appliance/1/ipaddr", "ipv4addr", "10.0.0.101"},
-             {STATES + "/51/appliance/1/weight", "uint32", "5"},
-             {STATES + "/51/appliance/2/ipaddr", "ipv4addr", "10.0.0.102"}}};
+    return {bindings_of(
+        "/qv/wccpd/wccp/srv_grp",
+        "%/config/51 uint8 51|%/config/51/weight uint32 100|%/config/7 uint8 7|"
+        "/logging/syslog/process/wccpd/log_level string info|"
+        "%/state/51 string 51|%/state/51/num_appliances uint32 2|%/state/51/oper string ACTIVE|"
+        "%/state/51/appliance/1/ipaddr ipv4addr 10.0.0.101|%/state/51/appliance/1/weight uint32 5|"
+        "%/state/51/appliance/2/ipaddr ipv4addr 10.0.0.102|")};
 }
 
-TEST(Names, AreCompletedToTheirNextPart) {
+TEST(Names, AreCompletedToTheirNextPartAndAMistypedOneGetsAHint) {
     canned_nodes known = sample_nodes();
     const auto check = [&](const std::string &word, const std::string &found) {
         EXPECT_EQ(joined(complete_node_name(std::ref(known), word), " "), found);
@@ -257,22 +234,16 @@ TEST(Names, AreCompletedToTheirNextPart) {
     check("/logging/syslog/action/file/\\/va", "/logging/syslog/action/file/\\/var\\/log\\/messages");
     check(G51 + "/encap=", G51 + "/encap=gre " + G51 + "/encap=l2 " + G51 + "/encap=either");
     check("qv", "");
-}
-
-TEST(Names, AMistypedOneGetsAHint) {
-    canned_nodes known = sample_nodes();
     const ctl_ask ask = std::ref(known);
-    const auto check = [&](const std::string &name, const std::string &hint) {
-        EXPECT_EQ(hint_for_missing(ask, name), hint);
-    };
-    check("qv/wccpd", "a name begins with \"/\"");
-    check("/qv//wccpd", "a name has no empty part");
-    check("/qv", "it has no value of its own; \"mgmtctl walk /qv\" lists what is below");
-    check("/qv/wcpd/system", "did you mean /qv/wccpd?");
-    check(G51 + "/wieght", "did you mean " + G51 + "/weight?");
-    check(G51 + "/interface", "it can be set, and has no default");
-    check(GROUPS + "/52/weight", "there is no group 52");
-    check(G51 + "/zzzzzz", "\"mgmtctl walk " + G51 + "\" lists what there is");
+    EXPECT_EQ(hint_for_missing(ask, "qv/wccpd"), "a name begins with \"/\"");
+    EXPECT_EQ(hint_for_missing(ask, "/qv//wccpd"), "a name has no empty part");
+    EXPECT_EQ(hint_for_missing(ask, "/qv"),
+              "it has no value of its own; \"mgmtctl walk /qv\" lists what is below");
+    EXPECT_EQ(hint_for_missing(ask, "/qv/wcpd/system"), "did you mean /qv/wccpd?");
+    EXPECT_EQ(hint_for_missing(ask, G51 + "/wieght"), "did you mean " + G51 + "/weight?");
+    EXPECT_EQ(hint_for_missing(ask, G51 + "/interface"), "it can be set, and has no default");
+    EXPECT_EQ(hint_for_missing(ask, GROUPS + "/52/weight"), "there is no group 52");
+    EXPECT_EQ(hint_for_missing(ask, G51 + "/zzzzzz"), "\"mgmtctl walk " + G51 + "\" lists what there is");
     EXPECT_EQ(hint_for_unchangeable(ask, STATES + "/51/oper"), "it is a state: it can only be read");
     EXPECT_EQ(hint_for_unchangeable(ask, G51 + "/weight"), "");
 }
@@ -281,8 +252,7 @@ TEST(Names, ANumberOfAppliancesThatCantBeMakesNoEndlessRowOfQuestions) {
     canned_nodes known = sample_nodes();
     std::vector<ctl_binding> many = {{STATES + "/51/num_appliances", "uint32", "4000000000"},
                                      {STATES + "/51/oper", "string", "x"}};
-    ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many));
-    EXPECT_EQ(known.asked, 64u);
+    ASSERT_TRUE(add_appliances(std::ref(known), STATES, &many) && known.asked == 64);
     EXPECT_EQ(many[1].value, "10.0.0.101") << "in their place";
     ctl_reply reply;
     ASSERT_TRUE(add_appliances(std::ref(known), STATES + "/51/appliance", &reply.bindings));
@@ -295,8 +265,7 @@ TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
         node_name parsed;
         ctl_reply reply;
         EXPECT_TRUE(parse_node_name(root, &parsed));
-        EXPECT_TRUE(query_walk(std::ref(known), ctl_walk::subtree, parsed, &reply));
-        EXPECT_EQ(reply.code, code);
+        EXPECT_TRUE(query_walk(std::ref(known), ctl_walk::subtree, parsed, &reply) && reply.code == code);
         strings out;
         for (const ctl_binding &binding : reply.bindings)
             out.push_back(binding.name);
@@ -313,25 +282,25 @@ TEST(Walks, WhatIsLargerThanAMessageComesInPieces) {
 
 // --- The session
 
-static wire frame_of(uint16_t mtype, const tbuffer *buffer) {
-    const auto *bytes = reinterpret_cast<const char *>(tb_buf(buffer));
-    return frame_bytes(2, mtype, {bytes, static_cast<size_t>(tb_length(buffer))});
+// A message of the service as a frame.
+template <auto Serialize, typename Message>
+static wire frame_of(const Message &msg) {
+    owned_tbuffer frame;
+    msg.pointer->service_id = 2;
+    EXPECT_EQ(Serialize(msg.pointer, 0, &frame.pointer), LC_OK);
+    return frame_bytes(2, msg.pointer->msg_type,
+                       {reinterpret_cast<const char *>(tb_buf(frame.pointer)),
+                        static_cast<size_t>(tb_length(frame.pointer))});
 }
 static wire event_frame(const char *name) {
     owned_request msg;
-    owned_tbuffer frame;
     EXPECT_EQ(bn_event_request_msg_create(&msg.pointer, name), LC_OK);
-    msg.pointer->service_id = 2;
-    EXPECT_EQ(bn_request_msg_serialize(msg.pointer, 0, &frame.pointer), LC_OK);
-    return frame_of(7, frame.pointer);
+    return frame_of<bn_request_msg_serialize>(msg);
 }
 static wire answer_frame(uint32_t response_to, uint32_t code, const char *text) {
     owned_response msg;
-    owned_tbuffer frame;
     EXPECT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, text), LC_OK);
-    msg.pointer->service_id = 2;
-    EXPECT_EQ(bn_response_msg_serialize(msg.pointer, 0, &frame.pointer), LC_OK);
-    return frame_of(2, frame.pointer);
+    return frame_of<bn_response_msg_serialize>(msg);
 }
 
 TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
@@ -347,34 +316,27 @@ TEST(Session, ARequestGetsItsOwnAnswerAndEventsWaitForTheirTurn) {
                      answer_frame(id, 14008, "no"));
         query = provider.take_frame();
         provider.close_client();
+        // The next session gets no service.
+        ASSERT_TRUE(provider.accept_client() && provider.put(greeting_bytes(~0u, ~0u)));
+        (void)provider.take_frame();
+        provider.put(open_response_bytes(number_at(provider.take_frame(), 32), 1, "no"));
+        (void)provider.take_frame();
     });
     ctl_session *session = ctl_open(3000, &reason);
     ASSERT_NE(session, nullptr) << reason;
     ctl_reply reply;
     EXPECT_TRUE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason)) << reason;
-    EXPECT_EQ(reply.code, 14008u);
-    EXPECT_EQ(reply.message, "no");
+    EXPECT_EQ(std::to_string(reply.code) + reply.message, "14008no");
     ctl_event event;
     for (const char *name : {"/one", "/two"}) {
-        EXPECT_EQ(ctl_next_event(session, 0, &event, &reason), 1);
-        EXPECT_EQ(event.name, name);
+        EXPECT_TRUE(ctl_next_event(session, 0, &event, &reason) == 1 && event.name == name);
     }
     EXPECT_FALSE(ctl_query(session, ctl_walk::node, "/a", &reply, &reason));
     EXPECT_EQ(reason, "mgmtd closed the session during the request");
     EXPECT_EQ(ctl_next_event(session, -1, &event, &reason), -1);
-    peer.join();
     ctl_close(session);
-
-    std::thread refusing([&] {
-        ASSERT_TRUE(provider.accept_client() && provider.put(greeting_bytes(~0u, ~0u)));
-        (void)provider.take_frame();
-        const wire request = provider.take_frame();
-        provider.put(open_response_bytes(number_at(request, 32), 1, "no"));
-        (void)provider.take_frame();
-    });
-    EXPECT_EQ(ctl_open(3000, &reason), nullptr);
-    EXPECT_EQ(reason, "mgmtd refuses its service to us");
-    refusing.join();
+    EXPECT_TRUE(!ctl_open(3000, &reason) && reason == "mgmtd refuses its service to us");
+    peer.join();
 }
 
 // --- What is wrong with the host
@@ -405,53 +367,45 @@ static std::string judge_host(const check_facts &host) {
 }
 
 TEST(Check, EachFactIsJudged) {
-    const struct {
-        void (*change)(check_facts *host);
-        const char *found;
-    } rows[] = {
-        {[](auto *) {}, ""},
-        {[](auto *host) { host->sockets[1].address = "0.0.0.0"; }, "port-taken "},
-        {[](auto *host) { host->sockets[1].address = "10.0.0.101"; }, "port-taken "},
-        {[](auto *host) { host->sockets[0].program = ""; }, "-UDP port 2048 "},
-        {[](auto *host) { host->sockets[0].program = "", host->wccpd_runs = false; },
-         "port-taken -locked memory "},
-        {[](auto *host) { host->groups[2].up = true; }, "interface-missing@53 "},
-        {[](auto *host) { host->groups[0].interface = host->groups[1].interface = ""; },
-         "no-interface@51 no-interface@52 "},
-        {[](auto *host) { host->interfaces["eth0"].up = false; }, "interface-down@51 "},
-        {[](auto *host) { host->interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 "},
-        {[](auto *host) { host->all_rp_filter = 1; }, "rp-filter rp-filter@52 "},
-        {[](auto *host) { host->interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 "},
-        {[](auto *host) { host->all_rp_filter = 2, host->interfaces["wccp0"].rp_filter = 1; }, ""},
-        {[](auto *host) { host->interfaces["wccp0"].forwarding = 0; }, "forwarding-off "},
-        {[](auto *host) { host->interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 "},
-        {[](auto *host) { host->interfaces["eth0"].mtu = 1499; }, "mtu-small@51 "},
-        {[](auto *host) { host->gre = check_feature::missing; }, "gre-by-tun "},
-        {[](auto *host) { host->gre = host->tun = check_feature::missing; }, "gre-missing "},
-        {[](auto *host) { host->tproxy = check_feature::missing, host->tun = check_feature::unknown; },
-         "tproxy-missing -kernel "},
-        {[](auto *host) { host->clock_synchronised = false; }, "clock-unsynchronised "},
-        {[](auto *host) { host->may_lock = false; }, ""}, // there is no limit
-        {[](auto *host) { host->may_lock = false, host->lock_limit_bytes = 65536; }, "memory-lock "},
-        {[](auto *host) { host->mem_conf.error = ENOENT, host->mem_conf.complete = false; },
-         "mem-conf-unreadable "},
-        {[](auto *host) { host->mem_conf.bad_line = 3, host->mem_conf.complete = false; },
-         "mem-conf-line mem-conf-mailbox "},
-        {[](auto *host) { host->mem_conf.error = EACCES, host->root = false; }, "-mem.conf "},
-        {[](auto *host) { host->platform_conf.error = ENOENT; }, ""},
-        {[](auto *host) { host->platform_conf.bad_line = 1; }, "platform-conf-line "},
-        {[](auto *host) { host->filter_error = "no", host->legacy_tables = "filter"; },
-         "-firewall -firewall "},
-        {[](auto *host) { host->mgmtd_error = "gone", host->groups.clear(), host->all_rp_filter = 1; },
-         "rp-filter -interfaces -rp_filter -forwarding -MTU "},
-    };
-    for (const auto &row : rows) {
+    using enum check_feature;
+    const auto check = [](void (*change)(check_facts &), const char *found) {
         check_facts host = sound_host();
-        row.change(&host);
+        change(host);
         if (!host.mgmtd_error.empty())
             host.sockets.clear();
-        EXPECT_EQ(judge_host(host), row.found) << &row - rows;
-    }
+        EXPECT_EQ(judge_host(host), found);
+    };
+    check([](auto &) {}, "");
+    check([](auto &it) { it.sockets[1].address = "0.0.0.0"; }, "port-taken ");
+    check([](auto &it) { it.sockets[1].address = "10.0.0.101"; }, "port-taken ");
+    check([](auto &it) { it.sockets[0].program = ""; }, "-UDP port 2048 ");
+    check([](auto &it) { it.sockets[0].program = "", it.wccpd_runs = false; }, "port-taken -locked memory ");
+    check([](auto &it) { it.groups[2].up = true; }, "interface-missing@53 ");
+    check([](auto &it) { it.groups[0].interface = it.groups[1].interface = ""; },
+          "no-interface@51 no-interface@52 ");
+    check([](auto &it) { it.interfaces["eth0"].up = false; }, "interface-down@51 ");
+    check([](auto &it) { it.interfaces["eth0"].addresses.clear(); }, "interface-no-address@51 ");
+    check([](auto &it) { it.all_rp_filter = 1; }, "rp-filter rp-filter@52 ");
+    check([](auto &it) { it.interfaces["eth0"].rp_filter = 1; }, "rp-filter@52 ");
+    check([](auto &it) { it.all_rp_filter = 2, it.interfaces["wccp0"].rp_filter = 1; }, "");
+    check([](auto &it) { it.interfaces["wccp0"].forwarding = 0; }, "forwarding-off ");
+    check([](auto &it) { it.interfaces["eth0"].forwarding = 0; }, "forwarding-later@52 ");
+    check([](auto &it) { it.interfaces["eth0"].mtu = 1499; }, "mtu-small@51 ");
+    check([](auto &it) { it.gre = missing; }, "gre-by-tun ");
+    check([](auto &it) { it.gre = it.tun = missing; }, "gre-missing ");
+    check([](auto &it) { it.tproxy = missing, it.tun = unknown; }, "tproxy-missing -kernel ");
+    check([](auto &it) { it.clock_synchronised = false; }, "clock-unsynchronised ");
+    check([](auto &it) { it.may_lock = false; }, ""); // there is no limit
+    check([](auto &it) { it.may_lock = false, it.lock_limit_bytes = 65536; }, "memory-lock ");
+    check([](auto &it) { it.mem_conf.error = ENOENT, it.mem_conf.complete = false; }, "mem-conf-unreadable ");
+    check([](auto &it) { it.mem_conf.bad_line = 3, it.mem_conf.complete = false; },
+          "mem-conf-line mem-conf-mailbox ");
+    check([](auto &it) { it.mem_conf.error = EACCES, it.root = false; }, "-mem.conf ");
+    check([](auto &it) { it.platform_conf.error = ENOENT; }, "");
+    check([](auto &it) { it.platform_conf.bad_line = 1; }, "platform-conf-line ");
+    check([](auto &it) { it.filter_error = "no", it.legacy_tables = "filter"; }, "-firewall -firewall ");
+    check([](auto &it) { it.mgmtd_error = "gone", it.groups.clear(), it.all_rp_filter = 1; },
+          "rp-filter -interfaces -rp_filter -forwarding -MTU ");
     const std::string documents = text_of_file(WCCP_SOURCE_DIR "/docs/operations.md");
     for (const reason_text &text : check_texts())
         EXPECT_TRUE(contains(documents, std::string("| `") + text.code + "` "));
@@ -519,22 +473,19 @@ TEST(Check, ThisHostIsLookedAt) {
     std::ofstream("/etc/opt/rvl/mem.conf") << "# x\nwccpd_mailbox local normal\nother here\n";
     std::ofstream("/etc/opt/rvl/platform.conf") << "max_interfaces 7\nmax_interfaces 0\nmax_x 1\n";
     const int fd = socket(AF_INET6, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    sockaddr_in6 local = {};
-    local.sin6_family = AF_INET6;
-    local.sin6_port = htons(2048);
+    const sockaddr_in6 local = {AF_INET6, htons(2048), 0, {}, 0};
     ASSERT_EQ(bind(fd, reinterpret_cast<const sockaddr *>(&local), sizeof local), 0);
     canned_nodes nodes = {{{G51, "uint8", "51"}, {G51 + "/interface", "string", "lo"}}};
     ctl_link link;
     link.query = std::ref(nodes);
     const check_facts host = gather_facts(link);
     close(fd);
-    ASSERT_EQ(host.groups.size(), 1u) << host.mgmtd_error;
+    ASSERT_TRUE(host.groups.size() == 1 && host.interfaces.contains("lo") && host.sockets.size() == 1)
+        << host.mgmtd_error;
     EXPECT_TRUE(host.groups[0].interface == "lo" && host.groups[0].up && host.groups[0].encap == "either");
-    ASSERT_EQ(host.interfaces.count("lo"), 1u);
     const check_interface &loopback = host.interfaces.at("lo");
     EXPECT_TRUE(loopback.up && loopback.addresses == strings{"127.0.0.1"} && loopback.mtu == 65536 &&
                 loopback.forwarding && loopback.rp_filter);
-    ASSERT_EQ(host.sockets.size(), 1u);
     EXPECT_TRUE(host.sockets[0].address == "0.0.0.0" && host.sockets[0].process == getpid());
     EXPECT_TRUE(host.mem_conf.error == 0 && host.mem_conf.bad_line == 3 && !host.mem_conf.complete);
     EXPECT_TRUE(host.platform_conf.error == 0 && host.platform_conf.bad_line == 2);

@@ -1,10 +1,5 @@
 // Interest lists and the bridge that carries their changes into the loop.
-#include <functional>
-#include <vector>
-
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "runtime/event_fdintrcb.h"
 #include "tests/support/gcl_log.h"
@@ -102,8 +97,7 @@ struct FdicBridge : testing::Test {
         ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
     }
     void TearDown() override {
-        EXPECT_EQ(fdic_libevent_deinit(&bridge), LC_OK);
-        EXPECT_EQ(fdic_deinit(&list), LC_OK);
+        EXPECT_TRUE(fdic_libevent_deinit(&bridge) == LC_OK && fdic_deinit(&list) == LC_OK);
         EXPECT_EQ(lew_deinit(&wrapper), LC_OK);
         close(ends[0]);
         close(ends[1]);
@@ -122,26 +116,10 @@ struct FdicBridge : testing::Test {
     }
 };
 
-TEST_F(FdicBridge, InterestsFollowTheirChanges) {
-    const int32_t id = add(1, 0);
-    EXPECT_EQ(calls, "4:44 ");
-    ASSERT_EQ(write(ends[1], "x", 1), 1);
-    expect_round("1:1 ");
-    EXPECT_EQ(fdic_event_update_fd(list, id, 0, 1), LC_OK);
-    expect_round("2:2 ");
-    EXPECT_EQ(fdic_event_update_fd(list, id, 1, 1), LC_OK);
-    expect_round("1:1 2:2 ");
-    calls.clear();
-    EXPECT_EQ(fdic_event_delete_fd(list, id), LC_OK);
-    EXPECT_EQ(calls, "5:55 ");
-    int none = 0;
-    EXPECT_EQ(lew_dispatch(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
-}
-
 TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
     gcl_log log;
     const int32_t id = add(1, 1);
+    EXPECT_EQ(calls, "4:44 ");
     ASSERT_EQ(write(ends[1], "x", 1), 1);
     for (const lc_status status : {LC_BAD_TYPE, LC_CANCELLED}) { // a failure ends this round of calls
         on_call = [status](uint32_t) { return status; };
@@ -152,16 +130,16 @@ TEST_F(FdicBridge, WhatAHandlerDoesToItsOwnInterest) {
         return kind == FDIC_READABLE ? fdic_event_delete_fd(list, id) : LC_OK;
     };
     expect_round("1:1 5:55 2:2 ");
+    int none = 0;
+    EXPECT_TRUE(lew_dispatch(wrapper, &none, nullptr) == LC_OK && none == 1);
 }
 
 TEST_F(FdicBridge, TimersFireOnce) {
-    int32_t id = 0, soon = 0;
-    int none = 0;
+    int32_t id = 0, soon = 0, none = 0;
     ASSERT_EQ(fdic_event_add_timer(list, 5, this, called, as_pointer(3), &id), LC_OK);
     expect_round("3:3 ");
     EXPECT_EQ(fdic_event_update_timer(list, id, 5), LC_OK); // the same delay does not start it again
-    EXPECT_EQ(lew_dispatch_once(wrapper, &none, nullptr), LC_OK);
-    EXPECT_EQ(none, 1);
+    EXPECT_TRUE(lew_dispatch_once(wrapper, &none, nullptr) == LC_OK && none == 1);
     // The largest delay does not overflow.
     EXPECT_EQ(fdic_event_update_timer(list, id, INT64_MAX), LC_OK);
     ASSERT_EQ(fdic_event_add_timer(list, 1, this, called, as_pointer(9), &soon), LC_OK);

@@ -2,30 +2,21 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <fstream>
 #include <regex>
 
-#include <sys/stat.h>
 #include <syslog.h>
 
 #include "runtime/logging_levels.h"
 #include "tests/support/log_daemon.h"
+#include "tests/support/texts.h"
 
 namespace {
 
-constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel";
-constexpr const char *ZONE = "/var/opt/rvl/output/localtime";
+constexpr const char *LINK = "/var/opt/rvl/output/sysloglevel", *ZONE = "/var/opt/rvl/output/localtime";
 
 void set_link(const char *target) {
     unlink(LINK);
     ASSERT_EQ(symlink(target, LINK), 0);
-}
-void write_file(const char *path, const std::string &text) {
-    std::ofstream(path) << text;
-}
-std::string read_file(const char *path) {
-    std::ifstream file(path);
-    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 // The text after the syslog head and the thread mark.
@@ -52,6 +43,7 @@ struct Log : testing::Test {
                    uint8_t destinations = 1) {
         return lc_log_init(name, prefix, flags, 0x1060000, 7, 136, destinations);
     }
+    void SetUp() override { ASSERT_EQ(init(), LC_OK); }
     void TearDown() override {
         unlink(LINK);
         (void)lc_log_close();
@@ -59,7 +51,8 @@ struct Log : testing::Test {
 };
 
 // The first test: nothing in this process has logged yet.
-TEST_F(Log, TheFirstLineSetsUpTheLog) {
+TEST(UnopenedLog, IsSetUpByTheFirstLine) {
+    log_daemon daemon;
     ASSERT_EQ(G_log_state_lock, nullptr);
     LC_LOG(LC_LOG_NOTICE, "early");
     EXPECT_TRUE(matches_regex(daemon.one(), "<13>.*runtime_logging_test-UNINIT\\[\\d+\\]: TID \\d+: "
@@ -67,7 +60,6 @@ TEST_F(Log, TheFirstLineSetsUpTheLog) {
 }
 
 TEST_F(Log, ALineHasTheBytesOfVsyslog) {
-    ASSERT_EQ(init(), LC_OK);
     for (const size_t length : {5u, 1000u, 9000u}) {
         const std::string text(length, 'x');
         std::string theirs, ours;
@@ -88,15 +80,14 @@ TEST_F(Log, ALineHasTheBytesOfVsyslog) {
 }
 
 TEST_F(Log, TheBodyOfALine) {
-    ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_NOTICE, "100%% of %s", "%s");
     EXPECT_EQ(body_of(daemon.one()), "[wccpd.NOTICE]: 100% of %s\n");
     util_log(LC_LOG_ERR, "pre: ", "%d%%", 5);
     EXPECT_EQ(body_of(daemon.one()), "[wccpd.ERR]: pre: 5%\n");
     errno = ENOENT;
     (void)lc_log_internal(nullptr, nullptr, 0, 0, 0x3f00000, LC_LOG_ERR, "%m");
-    EXPECT_EQ(errno, ENOENT);
-    EXPECT_EQ(body_of(daemon.one()), "[UNKNOWN_COMP.ERR]: No such file or directory\n");
+    EXPECT_TRUE(errno == ENOENT &&
+                body_of(daemon.one()) == "[UNKNOWN_COMP.ERR]: No such file or directory\n");
     ASSERT_EQ(init("wccpd", LC_LOG_FLAG_STAMP_USEC | LC_LOG_FLAG_RELATIVE, "prefix"), LC_OK);
     LC_LOG(LC_LOG_ERR, "text");
     EXPECT_TRUE(matches_regex(body_of(daemon.one()), "\\[0\\.0\\d{5}\\] \\[wccpd\\.ERR\\]: prefix: text\n"));
@@ -105,7 +96,6 @@ TEST_F(Log, TheBodyOfALine) {
 }
 
 TEST_F(Log, WhatDoesNotFitIsCut) {
-    ASSERT_EQ(init(), LC_OK);
     QV_LOG(LC_LOG_ERR, "%s", std::string(2000, 'y').c_str());
     EXPECT_EQ(body_of(daemon.one()), "[wccpd.ERR]: " + std::string(1023, 'y') + "\n");
     // Cuts the format at each position around its conversion.
@@ -123,16 +113,14 @@ TEST_F(Log, WhatDoesNotFitIsCut) {
 }
 
 TEST_F(Log, LevelsAndTheirOrder) {
-    ASSERT_EQ(init(), LC_OK);
     EXPECT_EQ(lc_log_set_max_log_level("debug"), LC_OK);
-    static const std::pair<int32_t, int32_t> levels[] = {{3, 3}, {0, 0}, {-1, 7}}; // own, and what passes
-    for (const auto &[own, passes] : levels) {
+    for (const auto &[own, passes] : {std::pair{3, 3}, {0, 0}, {-1, 7}}) {
         EXPECT_EQ(lc_log_set_daemon_log_level(own), LC_OK);
         EXPECT_TRUE(lc_log_check_level(passes) && !lc_log_check_level(passes + 1)) << own;
         EXPECT_EQ(level_of_mask(), passes);
     }
-    EXPECT_EQ(lc_log_set_max_log_level("Err"), LC_BAD_TYPE);
-    EXPECT_EQ(lc_log_set_max_log_level("warning"), LC_OK);
+    EXPECT_TRUE(lc_log_set_max_log_level("Err") == LC_BAD_TYPE &&
+                lc_log_set_max_log_level("warning") == LC_OK);
     int evaluated = 0;
     QV_LOG(LC_LOG_NOTICE, "%d", ++evaluated);
     EXPECT_EQ(evaluated, 0);
@@ -151,10 +139,8 @@ TEST_F(Log, LevelsAndTheirOrder) {
 }
 
 TEST_F(Log, TheOverrideAppliesWhileBothSwitchesAreOn) {
-    ASSERT_EQ(init(), LC_OK);
     const auto expect = [](lc_status status, int32_t level) {
-        EXPECT_EQ(status, LC_OK);
-        EXPECT_EQ(G_log_level, level);
+        EXPECT_TRUE(status == LC_OK && G_log_level == level);
     };
     expect(lc_log_set_override_log_level("debug"), 5);
     expect(lc_log_enable_override_log_level(1, 1), 5);
@@ -178,15 +164,14 @@ TEST_F(Log, TheLevelLink) {
     for (const auto &[target, level] : links) {
         set_link(target);
         ASSERT_EQ(init(), LC_OK);
-        EXPECT_EQ(G_log_level, level) << target;
-        EXPECT_EQ(level_of_mask(), level);
+        EXPECT_TRUE(G_log_level == level && level_of_mask() == level) << target;
     }
 }
 
 TEST_F(Log, UnmanagedProcessesFollowTheFiles) {
     for (const bool polls : {true, false}) {
         set_link("4");
-        write_file(ZONE, "one");
+        std::ofstream(ZONE) << "one";
         setenv("TZ", "XXX-5", 1);
         ASSERT_EQ(init(polls ? "poller" : "wccpd"), LC_OK);
         LC_LOG(LC_LOG_ERR, "one");
@@ -195,16 +180,15 @@ TEST_F(Log, UnmanagedProcessesFollowTheFiles) {
         ASSERT_EQ(utimensat(AT_FDCWD, ZONE, later, 0), 0);
         usleep(1100000); // the files are checked once a second
         LC_LOG(LC_LOG_ERR, "two");
-        EXPECT_EQ(G_log_level, polls ? 6 : 4);
-        EXPECT_EQ(getenv("TZ") == nullptr, polls);
+        EXPECT_TRUE(G_log_level == polls ? 6 : 4 && !getenv("TZ") == polls);
     }
     unsetenv("TZ");
     unlink(ZONE);
 }
 
 TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
-    ASSERT_EQ(init("tool", 0, nullptr, LOG_TO_STDERR), LC_OK);
-    EXPECT_EQ(lc_log_set_max_log_level("emerg"), LC_OK);
+    ASSERT_TRUE(init("tool", 0, nullptr, LOG_TO_STDERR) == LC_OK &&
+                lc_log_set_max_log_level("emerg") == LC_OK);
     testing::internal::CaptureStderr();
     LC_LOG(LC_LOG_ERR, "seen %d", 1);
     EXPECT_TRUE(matches_regex(testing::internal::GetCapturedStderr(),
@@ -214,9 +198,7 @@ TEST_F(Log, AConsoleGetsAHeaderAndKeepsItsLevel) {
 }
 
 TEST_F(Log, AfterTheCloseLinesAreDropped) {
-    ASSERT_EQ(init(), LC_OK);
-    EXPECT_EQ(lc_log_close(), LC_OK);
-    EXPECT_EQ(lc_log_close(), LC_NULL);
+    EXPECT_TRUE(lc_log_close() == LC_OK && lc_log_close() == LC_NULL);
     EXPECT_EQ(lc_log_internal(nullptr, nullptr, 0, 0, 0, LC_LOG_ERR, "x"), LC_GENERIC);
     EXPECT_EQ(lc_log_set_max_log_level("err"), LC_NULL); // its failure is not logged, and does not deadlock
     EXPECT_EQ(daemon.take().size(), 0u);
@@ -225,16 +207,15 @@ TEST_F(Log, AfterTheCloseLinesAreDropped) {
 TEST(Files, TheFacilityAndTheDebugLog) {
     static constexpr const char *FACILITY = "/var/opt/rvl/syslog_fac.conf", *DEBUG = "/var/log/debug_log";
     EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 136);
-    write_file(FACILITY, "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n");
-    EXPECT_EQ(lc_log_get_facility(nullptr, "wccpd"), 160);
-    EXPECT_EQ(lc_log_get_facility(nullptr, "mgmtctl"), 136);
-    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
+    std::ofstream(FACILITY) << "# system 8\nflow 144\nsystem\n\nsystem 160\nsystem 176\n";
+    EXPECT_TRUE(lc_log_get_facility(nullptr, "wccpd") == 160 &&
+                lc_log_get_facility(nullptr, "mgmtctl") == 136);
+    EXPECT_TRUE(matches_regex(text_of_file(DEBUG), "\\d{6} \\d{6} Skipping facility type: flow for wccpd\n"));
     unlink(FACILITY);
-    write_file(DEBUG, std::string(1999999, 'x') + "\n");
-    EXPECT_EQ(lc_log_file(nullptr, "%d", 1), 0);
-    EXPECT_GT(std::filesystem::file_size(DEBUG), 2000000u);
+    std::ofstream(DEBUG) << std::string(1999999, 'x') << "\n";
+    EXPECT_TRUE(lc_log_file(nullptr, "%d", 1) == 0 && std::filesystem::file_size(DEBUG) > 2000000);
     EXPECT_EQ(lc_log_file(nullptr, "%d", 2), 0); // too large to append to
-    EXPECT_TRUE(matches_regex(read_file(DEBUG), "\\d{6} \\d{6} 2\n"));
+    EXPECT_TRUE(matches_regex(text_of_file(DEBUG), "\\d{6} \\d{6} 2\n"));
     EXPECT_EQ(lc_log_file("/no/such/directory", "x"), 1);
     unlink(DEBUG);
 }

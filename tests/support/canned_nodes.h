@@ -2,11 +2,20 @@
 #pragma once
 
 #include <cstring>
-#include <string>
-#include <vector>
+#include <sstream>
 
 #include "peers/mgmtctl/session.h"
 #include "runtime/common.h"
+
+// Bindings from "NAME TYPE VALUE|NAME TYPE VALUE|" and so on. A "%" at the beginning of a name stands for
+// `root`.
+inline std::vector<ctl_binding> bindings_of(const std::string &root, const std::string &text) {
+    std::vector<ctl_binding> out;
+    std::istringstream in(text);
+    for (ctl_binding one; in >> one.name >> one.type && std::getline(in.ignore(), one.value, '|');)
+        out.push_back({one.name[0] == '%' ? root + one.name.substr(1) : one.name, one.type, one.value});
+    return out;
+}
 
 struct canned_nodes {
     std::vector<ctl_binding> nodes;
@@ -16,7 +25,10 @@ struct canned_nodes {
     uint32_t wccpd_code = 0;      // of its answers
 
     void add(const std::string &name, const std::string &value) { nodes.push_back({name, "string", value}); }
-    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out) {
+    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out,
+                    std::string *out_reason = nullptr) {
+        if (out_reason)
+            *out_reason = "mgmtd closed the session";
         if (asked++ >= lost_after)
             return false;
         if (name.find("/state") != std::string::npos && name.starts_with("/qv/wccpd"))
@@ -35,9 +47,5 @@ struct canned_nodes {
         if (out->bindings.size() > most)
             *out = {LC_NO_BUFFER_SPACE, "ask for less", {}};
         return true;
-    }
-    bool operator()(ctl_walk walk, const std::string &name, ctl_reply *out, std::string *out_reason) {
-        *out_reason = "mgmtd closed the session";
-        return (*this)(walk, name, out);
     }
 };

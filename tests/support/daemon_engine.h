@@ -2,10 +2,6 @@
 // groups exist, and nothing is sent.
 #pragma once
 
-#include <cstring>
-#include <new>
-#include <string>
-
 #include <gtest/gtest.h>
 
 #include "engine/wccp_config.h"
@@ -15,11 +11,11 @@
 #include "tests/support/gcl_log.h"
 #include "tests/support/owners.h"
 
-struct daemon_engine {
+struct daemon_test : testing::Test {
     gcl_log log;
     wccp_interface *interface;
 
-    daemon_engine() {
+    daemon_test() {
         new (&wccp_g) wccp_global{};
         wccp_g.mcast_ttl = 5;
         wccp_g.seconds = 1000;
@@ -30,17 +26,12 @@ struct daemon_engine {
         interface->ipa = to_be32(0x0a000001);
         wccp_init_policy_grp_mgr();
     }
-    ~daemon_engine() {
+    ~daemon_test() override {
         wccp_del_all_groups();
         EXPECT_EQ(wccp_g.group_count, 0u);
         EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
     }
-    daemon_engine(const daemon_engine &) = delete;
-    daemon_engine &operator=(const daemon_engine &) = delete;
-};
-struct daemon_test : testing::Test {
-    int said(const std::string &line) { return engine.log.count(line); } // lines that contain this text
-    daemon_engine engine;
+    int said(const std::string &line) { return log.count(line); } // lines that contain this text
 };
 
 constexpr be32 address(uint32_t last_octet) { // 10.0.0.x
