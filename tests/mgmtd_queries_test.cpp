@@ -16,27 +16,15 @@ struct Queries : Mgmtd {
     // Takes the last query to the daemon; returns its name and flags.
     std::string take_query(uint32_t peer_id) {
         EXPECT_EQ(sent.back().peer, peer_id);
-        const bn_request_per_node_array *nodes = sent.back().request->nodes;
-        const bn_request_node *node =
-            bn_request_per_node_array_get_quick(nodes, bn_request_per_node_array_length_quick(nodes) - 1);
+        const bn_request_node *node = last_node(sent.back().request);
         asked = sent.back().request->msg_id;
         node_id = node->node_id;
         const std::string out = name_of(node->binding) + " " + std::to_string(node->flags);
         clear();
         return out;
     }
-    // wccpd's answer.
     void answer(uint32_t peer_id, const std::vector<event_field> &fields, uint32_t with_code = 0) {
-        owned_response msg;
-        owned_tbuffer frame;
-        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, asked, with_code, nullptr), LC_OK);
-        for (const event_field &field : fields) {
-            bn_binding *binding = make_binding(field.name, field.value);
-            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
-        }
-        msg.pointer->service_id = 2;
-        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
-        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
+        answer_query(peer_id, asked, node_id, with_code, fields);
     }
     std::string answer_last(uint32_t peer_id, const std::vector<event_field> &fields,
                             uint32_t with_code = 0) {

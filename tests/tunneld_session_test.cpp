@@ -273,7 +273,7 @@ struct Session : Mgmtd, ticking_loop {
                 }
             }
             EXPECT_LE(walks, 8) << "wccpd is kept busy for long";
-            answer(1, msg->msg_id, last_node(msg)->node_id, 0, fields);
+            answer_query(1, msg->msg_id, last_node(msg)->node_id, 0, fields);
         }
     }
 };

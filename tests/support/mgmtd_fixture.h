@@ -127,6 +127,23 @@ struct Mgmtd : testing::Test {
             ASSERT_EQ(bn_query_request_msg_append_str(msg, subop, flags, each.c_str(), nullptr), LC_OK);
         EXPECT_TRUE(give(peer_id, msg));
     }
+    static const bn_request_node *last_node(const bn_request_msg *msg) {
+        return bn_request_per_node_array_get_quick(msg->nodes,
+                                                   bn_request_per_node_array_length_quick(msg->nodes) - 1);
+    }
+    void answer_query(uint32_t peer_id, uint32_t response_to, uint32_t node_id, uint32_t code,
+                      const std::vector<event_field> &fields) {
+        owned_response msg;
+        owned_tbuffer frame;
+        ASSERT_EQ(bn_query_response_msg_create(&msg.pointer, response_to, code, nullptr), LC_OK);
+        for (const event_field &field : fields) {
+            bn_binding *binding = make_binding(field.name, field.value);
+            ASSERT_EQ(bn_query_response_msg_append_binding_takeover(msg.pointer, &binding, node_id), LC_OK);
+        }
+        msg.pointer->service_id = 2;
+        ASSERT_EQ(bn_response_msg_serialize(msg.pointer, 32, &frame.pointer), LC_OK);
+        EXPECT_TRUE(server_take_frame(&daemon, peer_id, bn_msg_query_response, frame.pointer));
+    }
     struct set_node {
         uint32_t subop;
         std::string name, value;
