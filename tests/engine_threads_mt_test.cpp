@@ -40,6 +40,8 @@ void see_you(int fd, uint8_t id, const std::string &router, const std::string &a
 }
 
 struct Threads : testing::Test {
+    // Only the main thread may set up the log, which the first line would do.
+    static void SetUpTestSuite() { (void)lc_log_init("wccpd", "wccpd", 0, 0x1060000, LC_LOG_INFO, 128, 1); }
     void SetUp() override {
         alarm(240);
         fresh_engine();
@@ -247,6 +249,7 @@ TEST_F(Threads, AddressesChangeAndTheModeChangesUnderAFlood) {
     }
     over = true;
     flood.join();
+    const wccp_engine_lock lock;
     EXPECT_NE(wccp_if_find_interface("wan0")->complaints.spent, 0u)
         << "the complaints are counted for the receiver's interface";
 }

@@ -43,9 +43,9 @@ inline void fresh_engine() {
 }
 // Ends the engine's threads, groups, tunnels and sockets, and checks that all memory is freed.
 inline void end_engine() {
-    cthread_cancel_all();
     wccpd_exiting = 0;
-    wccp_del_all_groups();
+    wccp_del_all_groups(); // first: without groups no thread waits for tunneld while it is cancelled
+    cthread_cancel_all();
     EXPECT_TRUE(wccp_g.group_count == 0 && !wccp_g.group_list);
     wccp_del_all_tunnels();
     EXPECT_EQ(wccp_g.stat_allocs, wccp_g.stat_frees);
