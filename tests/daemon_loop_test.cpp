@@ -97,8 +97,8 @@ TEST_F(Loop, AnEscapeIsStickyAndEndsEachDepthAtOnce) {
     EXPECT_TRUE(first.runs == 1 && second.runs == 1 && inner[0].runs + inner[1].runs == 1);
 }
 
-// A callback waits by running the loop. The other events of its own round run in there, and what becomes
-// ready meanwhile.
+// A callback waits by running the loop, which then runs the other events of the same round, and those that
+// become ready during the wait.
 TEST_F(Loop, WaitsNestToAnyDepth) {
     constexpr int depth = 50;
     std::vector<watched> events(depth);

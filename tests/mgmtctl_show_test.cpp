@@ -214,7 +214,7 @@ std::string explanation_of(const snapshot &shown, int group, int exit, bool as_j
 
 // Each row breaks a group that works, or changes it.
 TEST(Show, AReasonHasACauseValuesATimeAndANextStep) {
-    // What is set, and what explain prints, all of the first reason.
+    // Sets the nodes, and looks for the text in what explain prints.
     const auto check = [](const std::string &nodes, const char *said, int exit = 1, const char *screen = "") {
         SCOPED_TRACE(nodes);
         canned_nodes from = one_group("");

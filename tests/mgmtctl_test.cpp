@@ -97,9 +97,9 @@ TEST(Changes, WhatARunningGroupFollowsOnlyAsAWholeIsTold) {
         {G51, GROUPS + "/52"},
         bindings_of(G51, "%/priority uint32 10|%/protocol string tcp|%/policy_grp uint32 3|"
                          "%/weight uint32 100|%/router/1 uint8 1|")};
-    const auto check = [&](const char *changes, const strings &created,
-                           const char *note) { // a piece of it
-        std::vector<ctl_change_item> items;    // NAME=VALUE, or NAME to remove it
+    // Changes are NAME=VALUE, or NAME to remove it; `note` is a piece of the note.
+    const auto check = [&](const char *changes, const strings &created, const char *note) {
+        std::vector<ctl_change_item> items;
         std::istringstream words(changes);
         for (std::string word; words >> word;) {
             const size_t end = std::min(word.find('='), word.size());

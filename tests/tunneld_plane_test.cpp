@@ -364,7 +364,8 @@ bytes receive_packet(int fd, int ms = 3000) {
 void send_by_hand() {
     const int back = socket(AF_INET, SOCK_RAW, IPPROTO_GRE);
     bytes packet = make_packet(PROTOCOL_UDP, 1, 1472);
-    const bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM, AT_LINK); // than a frame of the ring
+    // Larger than a frame of the ring.
+    const bytes large = make_packet(PROTOCOL_UDP, 2, LARGE_DATAGRAM, AT_LINK);
     send_gre(STRANGER, wrap_in_gre(0, GRE_TYPE_IPV4, packet));
     send_gre(ROUTER, wrap_in_gre(0x2000, GRE_TYPE_IPV4, packet, {0, 0, 0, 1}));
     send_gre(ROUTER, wrap_in_gre(GRE_CHECKSUM, GRE_TYPE_IPV4, large));
